@@ -25,7 +25,10 @@ function(vorbel_flatc target schema)
     COMMAND ${FLATC_EXECUTABLE} --cpp --scoped-enums -o ${_out_dir} ${_abs}
     DEPENDS ${_abs}
     COMMENT "flatc ${_name}.fbs")
-  target_sources(${target} PRIVATE ${_out})
+  # The rule lives in this folder; a custom target carries it to `target`,
+  # which may be defined in another folder.
+  add_custom_target(${_name}_generated DEPENDS ${_out})
+  add_dependencies(${target} ${_name}_generated)
   target_include_directories(${target} PUBLIC ${_out_dir})
   target_link_libraries(${target} PUBLIC flatbuffers_headers)
 endfunction()

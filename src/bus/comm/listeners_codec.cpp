@@ -1,0 +1,65 @@
+#include "bus/comm/listeners_codec.h"
+
+#include <algorithm>
+
+#include "listeners_message_generated.h"
+
+namespace comm {
+namespace {
+
+std::string copy_to_first_zero(const flatbuffers::String* text) {
+  const char* bytes = text->c_str();
+  return std::string(bytes, std::find(bytes, bytes + text->size(), '\0'));
+}
+
+}  // namespace
+
+std::vector<std::uint8_t> encode_listeners(std::uint32_t pid, const listener_list& listeners) {
+  flatbuffers::FlatBufferBuilder builder(1024);
+  std::vector<flatbuffers::Offset<wire::listener>> tables;
+  tables.reserve(listeners.size());
+  for (const listener& item : listeners) {
+    // The id string is made first and the id field added first: peers may
+    // compare buffers byte for byte.
+    const auto id = builder.CreateString(item.id);
+    const auto channel = builder.CreateString(item.channel);
+    wire::listenerBuilder table(builder);
+    table.add_id(id);
+    table.add_channel(channel);
+    tables.push_back(table.Finish());
+  }
+  const auto vector = builder.CreateVector(tables);
+  wire::listeners_messageBuilder root(builder);
+  root.add_listeners(vector);
+  root.add_pid(pid);  // a pid of 0 is the default and is left out
+  builder.Finish(root.Finish());
+  return std::vector<std::uint8_t>(builder.GetBufferPointer(),
+                                   builder.GetBufferPointer() + builder.GetSize());
+}
+
+bool decode_listeners(const std::uint8_t* data, std::size_t size, std::uint32_t& pid,
+                      listener_list& listeners) {
+  if (data == nullptr || size == 0) return false;
+  flatbuffers::Verifier verifier(data, size, listeners_max_depth, listeners_max_tables,
+                                 /* check_alignment */ true);
+  if (!wire::Verifylisteners_messageBuffer(verifier)) return false;
+  const wire::listeners_message* message = wire::Getlisteners_message(data);
+  const auto* items = message->listeners();
+  if (items == nullptr) return false;
+
+  std::vector<listener> received;
+  received.reserve(items->size());
+  for (const wire::listener* item : *items) {
+    if (item == nullptr || item->channel() == nullptr || item->id() == nullptr) return false;
+    received.push_back(listener{copy_to_first_zero(item->channel()), copy_to_first_zero(item->id())});
+  }
+  // Inserting each listener at its sorted place gives the sorted multiset;
+  // sorting once does the same in n log n, so a large hostile list cannot
+  // wedge the delivery thread.
+  std::sort(received.begin(), received.end());
+  pid = message->pid();
+  listeners.assign(std::make_move_iterator(received.begin()), std::make_move_iterator(received.end()));
+  return true;
+}
+
+}  // namespace comm

@@ -1,0 +1,27 @@
+// Encoding and decoding of the listeners message: pure functions over bytes,
+// free of Win32 calls, so that they can be fuzzed in a native build.
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <vector>
+
+#include "bus/listener.h"
+
+namespace comm {
+
+// Limits a received buffer must keep to be read at all.
+constexpr std::size_t listeners_max_depth = 64;
+constexpr std::size_t listeners_max_tables = 1000000;
+
+// The finished flatbuffers bytes for `pid` and `listeners` (list order kept).
+std::vector<std::uint8_t> encode_listeners(std::uint32_t pid, const listener_list& listeners);
+
+// Verifies `data` (depth 64, at most 1,000,000 tables, alignment checked) and
+// reads it. False when it fails verification, lacks the listeners vector, or
+// a listener lacks its channel or id: the whole message is then refused.
+// On success `listeners` holds the listeners in listener order.
+bool decode_listeners(const std::uint8_t* data, std::size_t size, std::uint32_t& pid,
+                      listener_list& listeners);
+
+}  // namespace comm

@@ -1,0 +1,157 @@
+// The listeners message on the wire: what a receiver accepts and refuses.
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <chrono>
+#include <random>
+
+#include "bus/comm/listeners_codec.h"
+#include "listeners_message_generated.h"
+
+namespace {
+
+using comm::decode_listeners;
+using comm::encode_listeners;
+
+listener_list decode_ok(const std::vector<std::uint8_t>& bytes, std::uint32_t& pid) {
+  listener_list out;
+  EXPECT_TRUE(decode_listeners(bytes.data(), bytes.size(), pid, out));
+  return out;
+}
+
+std::vector<std::uint8_t> finish(flatbuffers::FlatBufferBuilder& builder,
+                                 flatbuffers::Offset<comm::wire::listeners_message> root) {
+  builder.Finish(root);
+  return std::vector<std::uint8_t>(builder.GetBufferPointer(),
+                                   builder.GetBufferPointer() + builder.GetSize());
+}
+
+bool has_pid_field(const std::uint8_t* buffer) {
+  const auto* root = flatbuffers::GetRoot<flatbuffers::Table>(buffer);
+  return root->CheckField(comm::wire::listeners_message::VT_PID);
+}
+
+TEST(listeners_codec, round_trip_keeps_pid_and_every_listener) {
+  const listener_list sent = {{"a", "x"}, {"a", "y"}, {"b", "x"}, {"b", "x"}};
+  std::uint32_t pid = 0;
+  EXPECT_EQ(sent, decode_ok(encode_listeners(4242, sent), pid));
+  EXPECT_EQ(4242u, pid);
+}
+
+TEST(listeners_codec, empty_list_travels_with_pid_and_an_empty_vector) {
+  const auto bytes = encode_listeners(7, {});
+  const auto* message = comm::wire::Getlisteners_message(bytes.data());
+  ASSERT_NE(nullptr, message->listeners()) << "the vector must be present even when empty";
+  std::uint32_t pid = 0;
+  EXPECT_TRUE(decode_ok(bytes, pid).empty());
+  EXPECT_EQ(7u, pid);
+}
+
+TEST(listeners_codec, pid_zero_is_left_out_and_read_back_as_zero) {
+  const auto bytes = encode_listeners(0, {{"c", "i"}});
+  EXPECT_FALSE(has_pid_field(bytes.data()));
+  std::uint32_t pid = 99;
+  decode_ok(bytes, pid);
+  EXPECT_EQ(0u, pid);
+  EXPECT_TRUE(has_pid_field(encode_listeners(1, {}).data()));
+}
+
+TEST(listeners_codec, fields_are_added_in_the_agreed_order) {
+  // The id string is created before the channel string, so (building back to
+  // front) it lies after it in the buffer.
+  const auto bytes = encode_listeners(1, {{"channel-text", "id-text"}});
+  const auto* item = comm::wire::Getlisteners_message(bytes.data())->listeners()->Get(0);
+  EXPECT_GT(reinterpret_cast<std::uintptr_t>(item->id()), reinterpret_cast<std::uintptr_t>(item->channel()));
+}
+
+TEST(listeners_codec, a_received_list_is_put_in_listener_order) {
+  // A publisher that does not sort still yields a sorted list, duplicates
+  // adjacent.
+  flatbuffers::FlatBufferBuilder builder;
+  std::vector<flatbuffers::Offset<comm::wire::listener>> items;
+  for (const auto& [c, i] : std::vector<std::pair<const char*, const char*>>{
+           {"b", "1"}, {"a", "2"}, {"b", "0"}, {"a", "2"}, {"ab", ""}}) {
+    items.push_back(comm::wire::Createlistener(builder, builder.CreateString(c), builder.CreateString(i)));
+  }
+  const auto bytes = finish(builder, comm::wire::Createlisteners_message(builder, 5, builder.CreateVector(items)));
+  std::uint32_t pid = 0;
+  const listener_list expected = {{"a", "2"}, {"a", "2"}, {"ab", ""}, {"b", "0"}, {"b", "1"}};
+  EXPECT_EQ(expected, decode_ok(bytes, pid));
+}
+
+TEST(listeners_codec, strings_are_cut_at_their_first_zero_byte) {
+  const listener_list sent = {{std::string("chan\0nel", 8), std::string("i\0d", 3)}};
+  std::uint32_t pid = 0;
+  const auto got = decode_ok(encode_listeners(3, sent), pid);
+  ASSERT_EQ(1u, got.size());
+  EXPECT_EQ("chan", got.front().channel);
+  EXPECT_EQ("i", got.front().id);
+}
+
+TEST(listeners_codec, incomplete_messages_are_refused_whole) {
+  std::uint32_t pid = 0;
+  listener_list out;
+  {
+    flatbuffers::FlatBufferBuilder builder;
+    comm::wire::listeners_messageBuilder root(builder);
+    root.add_pid(12);
+    const auto bytes = finish(builder, root.Finish());
+    EXPECT_FALSE(decode_listeners(bytes.data(), bytes.size(), pid, out)) << "no listeners vector";
+  }
+  {
+    flatbuffers::FlatBufferBuilder builder;
+    const auto good = comm::wire::Createlistener(builder, builder.CreateString("a"), builder.CreateString("x"));
+    const auto no_id = comm::wire::Createlistener(builder, builder.CreateString("b"), 0);
+    const auto bytes = finish(builder, comm::wire::Createlisteners_message(
+                                           builder, 12, builder.CreateVector(std::vector{good, no_id})));
+    EXPECT_FALSE(decode_listeners(bytes.data(), bytes.size(), pid, out)) << "a listener without id";
+  }
+  {
+    flatbuffers::FlatBufferBuilder builder;
+    const auto no_channel = comm::wire::Createlistener(builder, 0, builder.CreateString("x"));
+    const auto bytes = finish(builder, comm::wire::Createlisteners_message(
+                                           builder, 12, builder.CreateVector(std::vector{no_channel})));
+    EXPECT_FALSE(decode_listeners(bytes.data(), bytes.size(), pid, out)) << "a listener without channel";
+  }
+  EXPECT_TRUE(out.empty()) << "a refused message yields nothing";
+}
+
+TEST(listeners_codec, damaged_bytes_are_refused_without_harm) {
+  const auto good = encode_listeners(77, {{"alpha", "one"}, {"beta", "two"}});
+  std::uint32_t pid = 0;
+  listener_list out;
+  EXPECT_FALSE(decode_listeners(nullptr, 16, pid, out));
+  EXPECT_FALSE(decode_listeners(good.data(), 0, pid, out));
+  for (std::size_t cut = 1; cut < good.size(); ++cut) {
+    EXPECT_FALSE(decode_listeners(good.data(), cut, pid, out)) << "truncated to " << cut;
+  }
+  // Every single-byte corruption either still verifies or is refused; it
+  // never crashes or reads out of bounds.
+  std::mt19937 random(1);
+  for (int round = 0; round < 2000; ++round) {
+    auto bytes = good;
+    bytes[random() % bytes.size()] = static_cast<std::uint8_t>(random());
+    listener_list any;
+    decode_listeners(bytes.data(), bytes.size(), pid, any);
+  }
+  std::vector<std::uint8_t> garbage(4096);
+  for (auto& b : garbage) b = static_cast<std::uint8_t>(random());
+  EXPECT_FALSE(decode_listeners(garbage.data(), garbage.size(), pid, out));
+}
+
+TEST(listeners_codec, a_large_unsorted_list_decodes_in_reasonable_time) {
+  // Inserting one by one into a list would take quadratic time: a hostile
+  // peer could wedge the delivery thread with one message.
+  listener_list sent;
+  std::mt19937 random(7);
+  for (int i = 0; i < 100000; ++i) sent.push_back({"channel" + std::to_string(random() % 1000), std::to_string(i)});
+  const auto bytes = encode_listeners(9, sent);
+  const auto start = std::chrono::steady_clock::now();
+  std::uint32_t pid = 0;
+  const auto got = decode_ok(bytes, pid);
+  EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(2));
+  EXPECT_EQ(sent.size(), got.size());
+  EXPECT_TRUE(std::is_sorted(got.begin(), got.end()));
+}
+
+}  // namespace
