@@ -1,0 +1,118 @@
+// Trust classification of peer processes by their image's signature, and
+// the cache that remembers each process's trust while it runs.
+#pragma once
+
+#include <windows.h>
+
+#include <cstddef>
+#include <cstdint>
+#include <filesystem>
+#include <map>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "platform/handles.h"
+#include "security/signature.h"
+
+enum class trust_level : std::uint32_t { low_trust = 0, high_trust = 1, untrusted = 2, unknown = 3 };
+
+// "low_trust", "high_trust", "untrusted", "unknown"; empty for other values.
+const wchar_t* trust_level_name(trust_level level);
+
+// The identity of a running process, and the key of the trust cache. Keys
+// order by creation time (high, then low 32 bits), pid, then image path, so
+// that older processes come first and a reused pid is a different key.
+struct process_info {
+  FILETIME creation_time;
+  std::uint32_t pid;
+  std::filesystem::path image_path;
+};
+
+bool operator<(const process_info& left, const process_info& right);
+
+// Creation time and image path of `process` (opened with query access).
+// Throws std::system_error ("GetProcessTimes failed", "GetModuleFileNameEx
+// failed") with the Win32 code.
+process_info get_process_info(std::uint32_t pid, HANDLE process);
+
+// Classifies image files against the current process's own signer.
+// Immutable after construction; any thread may call it at once.
+class signature_checker {
+ public:
+  // `current` is the current process's signature. One whose signer name is
+  // empty is not kept: an empty name could only ever "match" a peer whose
+  // signer could not be read either.
+  explicit signature_checker(std::optional<signature> current);
+
+  bool has_signature() const { return current_.has_value(); }
+  // True when the file's signature verifies.
+  bool check_low_security(const std::wstring& path);
+  // untrusted, low_trust or high_trust (same signer name, ASCII case
+  // ignored); never unknown.
+  trust_level get_process_trust(const std::wstring& path);
+
+ private:
+  std::optional<signature> current_;
+};
+
+// Remembers the trust of each classified process until the process exits.
+//
+// Owns one SYNCHRONIZE handle per entry. find and add run on any thread (the
+// IPC library's event threads); a monitoring thread of its own waits on every
+// held handle together with a stop and a wake event, and drops the entry of
+// a process that exits. The mutex guards the maps and the handles waiting to
+// be closed; it is never held during the wait. At most 62 handles are held
+// (62 + the two events = one wait's limit); past that, an insertion first
+// cuts each map to its 16 most recently created processes.
+//
+// Handles that a trim evicts may be part of the wait in progress, so they
+// are not closed on the inserting thread: the monitoring thread closes them
+// once it has rebuilt its wait list without them.
+class processes_trust_cache {
+ public:
+  static constexpr std::size_t max_handles = MAXIMUM_WAIT_OBJECTS - 2;
+  static constexpr std::size_t trimmed_map_size = 16;
+
+  processes_trust_cache();
+  processes_trust_cache(const processes_trust_cache&) = delete;
+  processes_trust_cache& operator=(const processes_trust_cache&) = delete;
+  ~processes_trust_cache();
+
+  // high_trust, low_trust or untrusted when cached; unknown otherwise.
+  trust_level find(const process_info& info);
+  // Stores `process` (SYNCHRONIZE access; the cache takes it) under `info`
+  // in the map of `trust`. An equal key already cached keeps its entry and
+  // the new handle is closed; unknown or other values store nothing.
+  void add(const process_info& info, winapi::unique_handle process, trust_level trust);
+
+  // Read-only views, for diagnostics and tests.
+  std::size_t size() const;
+  std::size_t count(trust_level trust) const;
+  // Evicted handles not yet closed by the monitoring thread.
+  std::size_t pending_close_count() const;
+  // False once the monitoring thread has ended.
+  bool monitoring() const;
+  // How many wait lists the monitoring thread has built so far.
+  std::uint64_t wait_rounds() const;
+
+ private:
+  using map_type = std::map<process_info, winapi::unique_handle>;
+
+  void monitor();
+  void trim_locked();
+  map_type* map_for_locked(trust_level trust);
+
+  map_type high_;
+  map_type low_;
+  map_type untrusted_;
+  mutable std::mutex mutex_;
+  std::thread thread_;
+  winapi::unique_handle stop_event_;
+  winapi::unique_handle wake_event_;
+  std::vector<winapi::unique_handle> evicted_;  // closed by the monitoring thread
+  bool monitoring_ = true;
+  std::uint64_t wait_rounds_ = 0;
+};

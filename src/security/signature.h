@@ -1,0 +1,40 @@
+// Authenticode signatures of image files: whether a file's embedded
+// signature verifies, and who signed it.
+//
+// Free functions without shared state; any thread may call them at once
+// (the gateway observer calls them from the IPC library's event threads).
+// System failures never throw: they travel as Win32-category error codes.
+#pragma once
+
+#include <optional>
+#include <string>
+#include <system_error>
+
+// The signer of a file: its signing certificate's serial number (hex, two
+// lower-case digits per byte, most significant byte first), and the simple
+// display names of the certificate's issuer and subject. The subject is the
+// signer name that trust classification compares.
+struct signature {
+  std::wstring serial_number;
+  std::wstring issuer;
+  std::wstring subject;
+};
+
+// True when the file's embedded signature verifies (no revocation check,
+// URL retrieval from the cache only). An unsigned file or a signature the
+// system distrusts is false with success; any other failure of verification
+// is false with the system's code.
+bool is_trusted(const std::wstring& path, std::error_code& code);
+
+// The signer of the file's first signature; an empty record and the code on
+// failure. A signature whose signer certificate is not in the embedded store
+// gives an empty record with success.
+signature read_signature(const std::wstring& path, std::error_code& code);
+
+// read_signature, traced, with a warning line on failure; absent whenever
+// the code is an error.
+std::optional<signature> get_signature(const std::wstring& path, std::error_code& code);
+
+// The signer of the current process's own image; absent on any failure (the
+// reason is only in the log).
+std::optional<signature> get_current_signature();
