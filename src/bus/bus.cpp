@@ -1,0 +1,207 @@
+#include "bus/bus.h"
+
+#include <windows.h>
+
+#include <algorithm>
+#include <iterator>
+#include <system_error>
+#include <utility>
+
+#include "bus/parlo/parlo.h"
+#include "logging/logger.h"
+#include "platform/win_api.h"
+
+using logging::level_critical;
+using logging::level_error;
+using logging::level_warning;
+using logging::logger_stream;
+
+namespace {
+
+// Loads parlo.dll from this component's own folder.
+template <typename Record>
+std::unique_ptr<Record> load_messaging_library() {
+  const std::wstring path = winapi::module_directory(winapi::current_module()) + L"parlo.dll";
+  auto record = std::make_unique<Record>();
+  record->module = winapi::load_library(path.c_str());
+  record->create_bus =
+      winapi::get_proc_address_as<decltype(record->create_bus)>(record->module.get(), "create_bus");
+  record->destroy_bus =
+      winapi::get_proc_address_as<decltype(record->destroy_bus)>(record->module.get(), "destroy_bus");
+  return record;
+}
+
+template <typename Record>
+parlo::bus* make_messaging_bus(const Record& library, const char* name) {
+  parlo::bus* created = library.create_bus(name);
+  if (created == nullptr) {
+    logger_stream(level_critical, L"make_messaging_bus") << L"create_bus fail";
+    // The library record unloads the module as the constructor unwinds.
+    winapi::throw_win_error(winapi::gen_failure, "create_bus failed");
+  }
+  return created;
+}
+
+listener_list difference(const listener_list& a, const listener_list& b) {
+  listener_list out;
+  std::set_difference(a.begin(), a.end(), b.begin(), b.end(), std::back_inserter(out));
+  return out;
+}
+
+}  // namespace
+
+bus::bus(const char* name)
+    : library_(load_messaging_library<library_record>()),
+      messaging_bus_(make_messaging_bus(*library_, name),
+                     messaging_bus_deleter{library_->destroy_bus}),
+      pid_(::GetCurrentProcessId()),
+      observer_list_(&observer_list()) {}
+
+bus::~bus() {
+  // The service channel goes first: until its subscription is released a
+  // delivery thread may still hand a message to this bus, which would lock a
+  // destroyed mutex.
+  service_channel_.reset();
+  // Then, by declaration order: the mutex and the table, the notifier (its
+  // queued tasks dropped), the messaging bus, the library, the observers.
+}
+
+void* bus::GetInterface(GUID iid) {
+  if (qm::same_iid(iid, IID_IQmBaseInterface) || qm::same_iid(iid, IID_ibus_base) ||
+      qm::same_iid(iid, IID_ibus)) {
+    return static_cast<ibus*>(this);
+  }
+  if (qm::same_iid(iid, IID_igateway_observer_base) || qm::same_iid(iid, IID_igateway_observer)) {
+    return static_cast<igateway_observer*>(this);
+  }
+  const qm::iid_halves h = qm::split_iid(iid);
+  logger_stream(level_warning, L"bus::GetInterface")
+      << L"unknown interface " << static_cast<unsigned long long>(h.first + h.last);
+  return nullptr;
+}
+
+void* bus::get_messaging_bus() { return messaging_bus_.get(); }
+
+std::uint32_t bus::register_listener(const char* channel, const char* id) {
+  logging::trace_scope trace(L"bus::register_listener");
+  if (channel == nullptr) {
+    logger_stream(level_error, L"bus::register_listener") << L"channel is nullptr";
+    return ERROR_INVALID_PARAMETER;
+  }
+  if (id == nullptr) {
+    logger_stream(level_error, L"bus::register_listener") << L"id is nullptr";
+    return ERROR_INVALID_PARAMETER;
+  }
+  std::lock_guard<std::mutex> lock(mutex_);
+  listener item{channel, id};
+  insert_sorted(listeners_[pid_], item);
+  post_new_listener(notifier_, observer_list_, pid_, item);
+  publish_locked();
+  return 0;
+}
+
+std::uint32_t bus::unregister_listener(const char* channel, const char* id) {
+  logging::trace_scope trace(L"bus::unregister_listener");
+  if (channel == nullptr) {
+    logger_stream(level_error, L"bus::unregister_listener") << L"channel is nullptr";
+    return ERROR_INVALID_PARAMETER;
+  }
+  if (id == nullptr) {
+    logger_stream(level_error, L"bus::unregister_listener") << L"listener_id is nullptr";
+    return ERROR_INVALID_PARAMETER;
+  }
+  std::lock_guard<std::mutex> lock(mutex_);
+  auto own = listeners_.find(pid_);
+  if (own == listeners_.end()) return 0;
+  const listener item{channel, id};
+  auto found = std::find(own->second.begin(), own->second.end(), item);
+  if (found == own->second.end()) return 0;
+  own->second.erase(found);
+  post_listener_removed(notifier_, observer_list_, pid_, item);
+  publish_locked();
+  return 0;
+}
+
+bool bus::is_registered_listener(const char* channel, const char* id) {
+  if (channel == nullptr) {
+    logger_stream(level_error, L"bus::is_registered_listener") << L"channel is nullptr";
+    return false;
+  }
+  if (id == nullptr) {
+    logger_stream(level_error, L"bus::is_registered_listener") << L"listener_id is nullptr";
+    return false;
+  }
+  const listener item{channel, id};
+  std::lock_guard<std::mutex> lock(mutex_);
+  for (const auto& [pid, list] : listeners_) {
+    if (std::find(list.begin(), list.end(), item) != list.end()) return true;
+  }
+  return false;
+}
+
+// Publishes a copy of this process's list; the caller holds `mutex_`.
+std::uint32_t bus::publish_locked() {
+  if (!service_channel_) return 0;
+  auto own = listeners_.find(pid_);
+  const listener_list copy = own != listeners_.end() ? own->second : listener_list();
+  return service_channel_->publish_listeners(pid_, copy);
+}
+
+std::uint32_t bus::on_listeners_requested() {
+  std::lock_guard<std::mutex> lock(mutex_);
+  return publish_locked();
+}
+
+void bus::on_remote_listeners(const std::uint32_t& pid, listener_list received) {
+  if (pid == pid_) return;
+  std::lock_guard<std::mutex> lock(mutex_);
+  auto entry = listeners_.find(pid);
+  if (entry == listeners_.end() || entry->second.empty()) {
+    post_new_listeners(notifier_, observer_list_, pid, received);
+    listeners_[pid] = std::move(received);
+    return;
+  }
+  if (received.empty()) {
+    post_listeners_removed(notifier_, observer_list_, pid, std::exchange(entry->second, {}));
+    return;
+  }
+  post_new_listeners(notifier_, observer_list_, pid, difference(received, entry->second));
+  post_listeners_removed(notifier_, observer_list_, pid, difference(entry->second, received));
+  entry->second = std::move(received);
+}
+
+void bus::drop_process(std::uint32_t pid) {
+  if (pid == pid_) return;
+  std::lock_guard<std::mutex> lock(mutex_);
+  auto entry = listeners_.find(pid);
+  if (entry == listeners_.end()) return;
+  listener_list gone = std::move(entry->second);
+  listeners_.erase(entry);
+  post_listeners_removed(notifier_, observer_list_, pid, std::move(gone));
+}
+
+void bus::on_connect() {
+  if (!service_channel_) return;
+  {
+    std::lock_guard<std::mutex> lock(mutex_);
+    publish_locked();
+  }
+  service_channel_->request_remote_listeners();
+}
+
+void bus::on_listen(const char*) {}
+void bus::on_local_connect(const char*, std::uint32_t) { on_connect(); }
+void bus::on_local_disconnect(const char*, std::uint32_t pid) { drop_process(pid); }
+void bus::on_local_start_communication(const char*, std::uint32_t) {}
+void bus::on_local_error(const char*, std::uint32_t, std::uint32_t) {}
+void bus::on_remote_connect(const char*, std::uint32_t) { on_connect(); }
+void bus::on_remote_disconnect(const char*, std::uint32_t pid) { drop_process(pid); }
+void bus::on_remote_start_communication(const char*, std::uint32_t) {}
+void bus::on_remote_error(const char*, std::uint32_t, std::uint32_t) {}
+
+void bus::subscribe() {
+  service_channel_ = comm::make_service_channel(this);
+  if (service_channel_) service_channel_->subscribe(this);
+}
+
+void bus::unsubscribe() { service_channel_.reset(); }

@@ -1,0 +1,103 @@
+// The bus behind every bus name of the registry.
+//
+// Owns its messaging-library bus (and the library), its service channel, its
+// notifier thread and the listener table of this process and of every
+// connected process. Created and destroyed by the registry under its mutex.
+// Host threads call the ibus operations; the messaging library's delivery
+// threads call the service-channel face; the gateway's notification thread
+// calls the igateway_observer face. `mutex_` guards the table and every
+// publication of this process's listeners; notifications never run under it:
+// they are posted to `notifier_` and run there one at a time.
+#pragma once
+
+#include <vorbel/ibus.h>
+#include <vorbel/igateway.h>
+
+#include <cstdint>
+#include <map>
+#include <memory>
+#include <mutex>
+#include <string>
+
+#include "bus/comm/service_channel.h"
+#include "bus/listener.h"
+#include "bus/notifications.h"
+#include "platform/handles.h"
+#include "platform/observable.h"
+#include "platform/task_pool.h"
+
+namespace parlo {
+class bus;
+}
+
+class bus final : public qm::observable<ibus_observer_base*, ibus>,
+                  public comm::iservice_channel_observer,
+                  public igateway_observer {
+ public:
+  // Loads parlo.dll from this component's folder and creates the library's
+  // bus for `name`. Throws std::system_error when it cannot.
+  explicit bus(const char* name);
+  bus(const bus&) = delete;
+  bus& operator=(const bus&) = delete;
+  ~bus() override;
+
+  // IQmBaseInterface, for both the ibus and the igateway_observer faces.
+  void* GetInterface(GUID iid) override;
+
+  // ibus
+  void* get_messaging_bus() override;
+  std::uint32_t register_listener(const char* channel, const char* id) override;
+  std::uint32_t unregister_listener(const char* channel, const char* id) override;
+  bool is_registered_listener(const char* channel, const char* id) override;
+
+  // comm::iservice_channel_observer
+  std::uint32_t on_listeners_requested() override;
+  void on_remote_listeners(const std::uint32_t& pid, listener_list listeners) override;
+
+  // igateway_observer
+  void on_listen(const char* name) override;
+  void on_local_connect(const char* name, std::uint32_t pid) override;
+  void on_local_disconnect(const char* name, std::uint32_t pid) override;
+  void on_local_start_communication(const char* name, std::uint32_t pid) override;
+  void on_local_error(const char* name, std::uint32_t pid, std::uint32_t err) override;
+  void on_remote_connect(const char* name, std::uint32_t pid) override;
+  void on_remote_disconnect(const char* name, std::uint32_t pid) override;
+  void on_remote_start_communication(const char* name, std::uint32_t pid) override;
+  void on_remote_error(const char* name, std::uint32_t pid, std::uint32_t err) override;
+
+  // Creates the service channel and starts receiving on it (a failure is
+  // logged and leaves the bus without one).
+  void subscribe();
+  // Ends the subscription and destroys the service channel.
+  void unsubscribe();
+  // Null before subscribe, after unsubscribe, or when its creation failed.
+  comm::service_channel* get_service_channel() const { return service_channel_.get(); }
+
+  std::uint32_t pid() const { return pid_; }
+
+ private:
+  struct library_record {
+    winapi::unique_module module;
+    parlo::bus* (*create_bus)(const char*);
+    void (*destroy_bus)(parlo::bus*);
+  };
+  struct messaging_bus_deleter {
+    void (*destroy_bus)(parlo::bus*);
+    void operator()(parlo::bus* b) const { destroy_bus(b); }
+  };
+
+  std::uint32_t publish_locked();
+  void on_connect();
+  void drop_process(std::uint32_t pid);
+
+  // Declaration order is teardown order in reverse: the library outlives the
+  // messaging bus, which outlives the notifier and the table.
+  std::unique_ptr<library_record> library_;
+  std::unique_ptr<parlo::bus, messaging_bus_deleter> messaging_bus_;
+  std::uint32_t pid_;
+  std::unique_ptr<comm::service_channel> service_channel_;
+  bus_observer_list* observer_list_;
+  task_pool<0> notifier_;
+  std::map<std::uint32_t, listener_list> listeners_;
+  std::mutex mutex_;
+};

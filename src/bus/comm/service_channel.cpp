@@ -1,0 +1,189 @@
+#include "bus/comm/service_channel.h"
+
+#include <windows.h>
+
+#include <vorbel/ibus.h>
+
+#include "bus/comm/listeners_codec.h"
+#include "bus/parlo/parlo.h"
+#include "gateway/parlo_ipc/parlo_ipc.h"
+#include "logging/logger.h"
+
+namespace comm {
+namespace {
+
+using logging::level_error;
+using logging::level_info;
+using logging::logger_stream;
+
+constexpr const char* params_blob = "params";
+
+void on_service_message(parlo::message* message, void* context) {
+  if (message == nullptr || context == nullptr) return;
+  static_cast<service_channel*>(context)->on_message(message);
+}
+
+parlo::bus* messaging_bus_of(ibus* bus) {
+  return static_cast<parlo::bus*>(bus->get_messaging_bus());
+}
+
+}  // namespace
+
+std::unique_ptr<service_channel> make_service_channel(ibus* bus) {
+  parlo::bus* messaging = messaging_bus_of(bus);
+  const std::uint32_t created = messaging->create_channel(service_channel_name);
+  if (created != 0) {
+    logger_stream(level_error, L"comm::make_service_channel") << L"create_channel err=" << created;
+    return nullptr;
+  }
+  parlo::channel* channel = messaging->get_channel(service_channel_name);
+  if (channel == nullptr) {
+    logger_stream(level_error, L"comm::make_service_channel") << L"get_channel failed";
+    return nullptr;
+  }
+  return std::make_unique<service_channel>(bus, channel);
+}
+
+service_channel::service_channel(ibus* bus, parlo::channel* channel)
+    : bus_(bus), channel_(channel), own_pid_(::GetCurrentProcessId()) {}
+
+service_channel::~service_channel() { release_subscription(); }
+
+void service_channel::release_subscription() {
+  if (subscription_ == nullptr) return;
+  if (parlo::channel* channel = subscription_->get_subscription_channel()) {
+    channel->destroy_subscription(subscription_);
+  }
+  subscription_ = nullptr;
+}
+
+void service_channel::subscribe(iservice_channel_observer* observer) {
+  parlo::subscription* subscription = channel_->create_subscription();
+  if (subscription == nullptr) {
+    logger_stream(level_error, L"comm::service_channel::subscribe") << L"subscribe failed";
+    return;
+  }
+  // Fixed before listen: the delivery threads read it without a lock.
+  observer_ = observer;
+  const std::uint32_t listening = subscription->listen(&on_service_message, this, 0);
+  if (listening != 0) {
+    logger_stream(level_error, L"comm::service_channel::subscribe")
+        << L"subscription listen err=" << listening;
+    observer_ = nullptr;
+    if (parlo::channel* channel = subscription->get_subscription_channel()) {
+      channel->destroy_subscription(subscription);
+    }
+    return;
+  }
+  subscription_ = subscription;
+}
+
+std::uint32_t service_channel::export_channel(parlo::ipc::gateway* ipc, const char* pipe) {
+  if (exported_pipes_.count(pipe) != 0) {
+    logger_stream(level_info, L"comm::service_channel::export_channel")
+        << L"already exported on pipe=" << pipe;
+    return 0;
+  }
+  const std::uint32_t result = ipc->export_channel(service_channel_name, pipe, /* link_type */ 3);
+  if (result != 0) {
+    // Not recorded: a later export on this pipe tries again.
+    logger_stream(level_error, L"comm::service_channel::export_channel")
+        << L"export_channel service on pipe=" << pipe << L" err=" << result;
+    return result;
+  }
+  exported_pipes_.insert(pipe);
+  return 0;
+}
+
+std::uint32_t service_channel::import_channel(parlo::ipc::gateway* ipc, const char* bus_name,
+                                              const char* pipe) {
+  if (imported_pipes_.count(pipe) != 0) {
+    logger_stream(level_info, L"comm::service_channel::import_channel")
+        << L"already imported on pipe=" << pipe;
+    return 0;
+  }
+  const std::uint32_t result =
+      ipc->import_channel(service_channel_name, pipe, bus_name,
+                          /* remote_channel */ service_channel_name, /* link_type */ 3);
+  if (result != 0) {
+    logger_stream(level_error, L"comm::service_channel::import_channel")
+        << L"import_channel service on pipe=" << pipe << L" err=" << result;
+    return result;
+  }
+  imported_pipes_.insert(pipe);
+  return 0;
+}
+
+parlo::message* service_channel::new_message(const wchar_t* function,
+                                             service_channel_messages_id id) {
+  parlo::message* message = messaging_bus_of(bus_)->create_message(0);
+  if (message == nullptr) {
+    logger_stream(level_error, function) << L"create_message failed";
+    return nullptr;
+  }
+  message->set_message_id(static_cast<std::uint32_t>(id));
+  return message;
+}
+
+std::uint32_t service_channel::request_remote_listeners() {
+  parlo::message* message = new_message(L"comm::service_channel::request_remote_listeners",
+                                        service_channel_messages_id::publish_listeners);
+  if (message == nullptr) return ERROR_OUTOFMEMORY;
+  message->seal();
+  const std::uint32_t posted = channel_->post(message);
+  message->release();
+  if (posted != 0) {
+    logger_stream(level_error, L"comm::service_channel::request_remote_listeners")
+        << L"post publish listeners message err=" << posted;
+  }
+  return posted;
+}
+
+std::uint32_t service_channel::publish_listeners(std::uint32_t pid, const listener_list& listeners) {
+  parlo::message* message = new_message(L"comm::service_channel::publish_listeners",
+                                         service_channel_messages_id::listeners);
+  if (message == nullptr) return ERROR_OUTOFMEMORY;
+  {
+    const std::vector<std::uint8_t> bytes = encode_listeners(pid, listeners);
+    message->set_blob(params_blob, bytes.data(), bytes.size());
+  }
+  message->seal();
+  const std::uint32_t posted = channel_->post(message);
+  message->release();
+  if (posted != 0) {
+    logger_stream(level_error, L"comm::service_channel::publish_listeners")
+        << L"post listeners message err=" << posted;
+  }
+  return posted;
+}
+
+void service_channel::on_message(parlo::message* message) {
+  const std::uint32_t id = message->message_id();
+  if (id == static_cast<std::uint32_t>(service_channel_messages_id::publish_listeners)) {
+    observer_->on_listeners_requested();
+    return;
+  }
+  if (id != static_cast<std::uint32_t>(service_channel_messages_id::listeners)) return;
+
+  std::uint64_t size = 0;
+  const void* bytes = message->get_blob(params_blob, &size);
+  if (bytes == nullptr || size == 0) {
+    logger_stream line(level_error, L"comm::service_channel::on_message");
+    line << L"unexpected service_channel_messages_id::listeners params blob: ";
+    if (bytes == nullptr) line << L" buf is nullptr, ";
+    if (size == 0) line << L"size=0";
+    return;
+  }
+  std::uint32_t pid = 0;
+  listener_list listeners;
+  // A buffer that fails verification is dropped without a line: a peer could
+  // otherwise flood the log.
+  if (!decode_listeners(static_cast<const std::uint8_t*>(bytes), static_cast<std::size_t>(size), pid,
+                        listeners)) {
+    return;
+  }
+  if (pid == own_pid_) return;  // this process's own publication
+  observer_->on_remote_listeners(pid, std::move(listeners));
+}
+
+}  // namespace comm

@@ -1,0 +1,94 @@
+// The service channel "vorbel_service": the buses of different processes tell
+// each other their listeners on it.
+//
+// One per bus, owned by the bus. The messaging library runs on_message on its
+// delivery threads between listen and the end of the subscription; the
+// service channel takes no lock of its own: it reads only `observer_` and
+// `own_pid_`, fixed while the subscription lives, and hands everything else
+// to the bus. export_channel and import_channel run only under the bus
+// registry's mutex, through the gateway.
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <set>
+#include <string>
+
+#include "bus/listener.h"
+
+struct ibus;
+
+namespace parlo {
+class channel;
+class message;
+class subscription;
+}  // namespace parlo
+
+namespace parlo::ipc {
+class gateway;
+}
+
+namespace comm {
+
+constexpr const char* service_channel_name = "vorbel_service";
+
+enum class service_channel_messages_id : std::uint32_t {
+  publish_listeners = 1,  // no content: asks every receiver to publish
+  listeners = 2,          // blob "params": the listeners message
+};
+
+// What the bus does with what arrives on the service channel.
+struct iservice_channel_observer {
+  // A process asked for this process's listeners.
+  virtual std::uint32_t on_listeners_requested() = 0;
+  // A process published its listeners; the list is the observer's.
+  virtual void on_remote_listeners(const std::uint32_t& pid, listener_list listeners) = 0;
+
+ protected:
+  ~iservice_channel_observer() = default;
+};
+
+class service_channel {
+ public:
+  service_channel(ibus* bus, parlo::channel* channel);
+  service_channel(const service_channel&) = delete;
+  service_channel& operator=(const service_channel&) = delete;
+  // Ends the subscription first, so no callback reaches a destroyed object.
+  ~service_channel();
+
+  // Subscribes and starts delivering to `observer`. Failures are logged; the
+  // channel then receives nothing.
+  void subscribe(iservice_channel_observer* observer);
+
+  // Carries the service channel over `pipe` too (once per pipe).
+  std::uint32_t export_channel(parlo::ipc::gateway* ipc, const char* pipe);
+  std::uint32_t import_channel(parlo::ipc::gateway* ipc, const char* bus_name, const char* pipe);
+
+  // Posts this process's listeners. Called under the bus's mutex: it must not
+  // call back into the bus.
+  std::uint32_t publish_listeners(std::uint32_t pid, const listener_list& listeners);
+  // Asks every process on the channel to publish its listeners.
+  std::uint32_t request_remote_listeners();
+
+  void on_message(parlo::message* message);
+
+  bool subscribed() const { return subscription_ != nullptr; }
+
+ private:
+  void release_subscription();
+  parlo::message* new_message(const wchar_t* function, service_channel_messages_id id);
+
+  ibus* bus_;
+  parlo::channel* channel_;
+  iservice_channel_observer* observer_ = nullptr;
+  std::uint32_t own_pid_;
+  parlo::subscription* subscription_ = nullptr;
+  std::set<std::string> exported_pipes_;
+  std::set<std::string> imported_pipes_;
+};
+
+// Creates "vorbel_service" on the bus's messaging bus; null (logged) when the
+// library refuses.
+std::unique_ptr<service_channel> make_service_channel(ibus* bus);
+
+}  // namespace comm
