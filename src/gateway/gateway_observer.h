@@ -1,0 +1,93 @@
+// The event sink the gateway hands to the IPC library.
+//
+// Owned by the gateway, which creates it before the IPC library's gateway
+// and destroys it after that (so no library thread can call a destroyed
+// sink). The library calls the nine event operations from its own threads,
+// possibly several at once. Admission reads the signature checker and the
+// pipe security map without a lock (both are fixed before the library
+// starts) and uses the trust cache's own mutex. Everything that touches the
+// connections cache or the gateway's observers runs as a task on the notify
+// context's single worker: the event operations only post, so the library's
+// threads never wait for observers.
+#pragma once
+
+#include <windows.h>
+
+#include <cstdint>
+#include <map>
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "gateway/connections_cache.h"
+#include "gateway/notify_tasks.h"
+#include "gateway/parlo_ipc/parlo_ipc.h"
+#include "platform/task_pool.h"
+#include "security/pipe_security.h"
+#include "security/process_trust.h"
+
+// Pipe name (a backslash and the pipe's own name, UTF-8) → pipe security
+// level: 0 admits high_trust peers only, 1 also low_trust peers.
+using pipe_security_map = std::map<std::string, std::uint32_t>;
+
+// The level of the pipe behind `pipe`, read by its name; absent when the name
+// cannot be read or the pipe is not in `map`.
+std::optional<std::uint32_t> get_pipe_security(const pipe_security_map& map, HANDLE pipe);
+
+// The observer's map from the gateway's pipe table: a name that starts with
+// the "\\.\pipe" prefix (in any letter case) is keyed without it, which is
+// how the name reads back from the pipe's handle. The first name in table
+// order wins a key.
+pipe_security_map make_pipe_security_map(const std::map<std::string, std::uint32_t>& pipes);
+
+class gateway_observer final : public parlo::ipc::gateway::events {
+ public:
+  // `observers` is the gateway's observer list; the gateway owns it and
+  // outlives this object.
+  explicit gateway_observer(gateway_observer_list* observers);
+  gateway_observer(const gateway_observer&) = delete;
+  gateway_observer& operator=(const gateway_observer&) = delete;
+  ~gateway_observer();
+
+  void on_listen(parlo::ipc::pipe_handle pipe, const char* name) override;
+  bool on_local_connect(parlo::ipc::pipe_handle pipe, std::uint32_t pid) override;
+  void on_local_disconnect(parlo::ipc::pipe_handle pipe) override;
+  void on_local_start_communication(parlo::ipc::pipe_handle pipe) override;
+  void on_local_error(parlo::ipc::pipe_handle pipe, std::uint32_t err) override;
+  bool on_remote_connect(parlo::ipc::pipe_handle pipe, std::uint32_t pid) override;
+  void on_remote_disconnect(parlo::ipc::pipe_handle pipe) override;
+  void on_remote_start_communication(parlo::ipc::pipe_handle pipe) override;
+  void on_remote_error(parlo::ipc::pipe_handle pipe, std::uint32_t err) override;
+
+  // The trust part of admission: may process `pid` connect to a pipe of
+  // security `level`?
+  bool is_allowed_process(std::uint32_t pid, std::uint32_t level);
+  // Remembers a freshly classified process until it exits.
+  void cache_process(const process_info& info, trust_level trust);
+
+  // Called by the gateway's start, before the IPC library starts.
+  void set_pipe_security_map(pipe_security_map map) { pipe_security_ = std::move(map); }
+
+  // For tests and diagnostics: runs `probe` on the worker after every task
+  // posted so far, and waits for it.
+  void run_on_worker(const std::function<void(connections_cache&)>& probe);
+
+ private:
+  struct notify_context {
+    explicit notify_context(gateway_observer_list* list) : observers(list) {}
+    gateway_observer_list* observers;
+    connections_cache connections;
+    // Last member: shut down first, before the cache its tasks point to.
+    task_pool<0> pool;
+  };
+
+  bool is_allowed(HANDLE pipe, std::uint32_t pid);
+  void apply_security(HANDLE pipe);
+  void post_event(gateway_event event, HANDLE pipe, std::uint32_t pid = 0, std::uint32_t err = 0);
+
+  std::unique_ptr<notify_context> context_;
+  signature_checker signature_checker_;
+  pipes_security_descriptor pipes_security_descriptor_;
+  processes_trust_cache trust_cache_;
+  pipe_security_map pipe_security_;
+};
