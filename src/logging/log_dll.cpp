@@ -12,6 +12,9 @@ namespace {
 volatile long g_spin = 0;
 CLogDLL* g_instance = nullptr;
 volatile long g_count = 0;
+// Set by a detach during process termination: the loader may already have
+// detached scribo.dll, so no later line may bind it again.
+bool g_process_ending = false;
 
 class spin_guard {
  public:
@@ -60,7 +63,12 @@ HMODULE find_library() {
 
 CLogDLL* make_instance() {
   auto* log = new (std::nothrow) CLogDLL{};
-  if (log != nullptr) bind(*log);
+  if (log == nullptr) return nullptr;
+  if (g_process_ending) {
+    log->LogWrite = &noop_log_write;
+  } else {
+    bind(*log);
+  }
   return log;
 }
 
@@ -151,6 +159,7 @@ void process_attach() {
 
 void process_detach(bool process_terminating) {
   spin_guard guard;
+  if (process_terminating) g_process_ending = true;
   if (g_count >= 1) --g_count;
   if (g_instance != nullptr && g_count == 0) {
     destroy_instance(g_instance, /* library_gone */ process_terminating);

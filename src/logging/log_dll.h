@@ -61,7 +61,7 @@ std::int32_t reference_count();
 CLogDLL* current_instance();
 
 // Takes one reference, binding a new instance when the count is 0. Returns the
-// instance.
+// instance; null when it could not be allocated (the reference still counts).
 CLogDLL* add_reference();
 // Gives one reference back; the last one unbinds and frees the instance.
 void release_reference();
@@ -71,7 +71,9 @@ void release_reference();
 void process_attach();
 // DllMain's process detach. `process_terminating` (the loader's reserved
 // pointer was not null): the library may already be detached, so the
-// instance is freed without calling into it.
+// instance is freed without calling into it, and from then on a reference
+// that finds no binding gets the dropping writer instead of loading the
+// library again.
 void process_detach(bool process_terminating);
 
 // Holder of the references taken for one use (one LogWrite call).

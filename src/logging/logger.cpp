@@ -50,8 +50,14 @@ logger_stream::~logger_stream() {
   if (reference_count() == 0) return;  // no binding: the line is dropped
   logger_ref ref;
   CLogDLL* log = ref.acquire();
-  const std::wstring text = str();
-  log->LogWrite(0, &level_, this_module(), function_, L"%s", text.c_str());
+  if (log == nullptr) return;  // no memory for a binding
+  try {
+    const std::wstring text = str();
+    log->LogWrite(0, &level_, this_module(), function_, L"%s", text.c_str());
+  } catch (...) {
+    // No memory for the text: the line is lost, the caller goes on. A
+    // destructor must not let the exception out.
+  }
 }
 
 logger_stream& logger_stream::operator<<(const wchar_t* text) {
@@ -89,12 +95,15 @@ trace_scope::trace_scope(const wchar_t* name) : start(::timeGetTime()) {
   append_bounded(display_name, 260, L"()");
   copy_truncated(function_name, 260, name);
   logger_ref ref;
-  ref.acquire()->LogWrite(1, &trace_level, this_module(), function_name, L"-> %s", display_name);
+  if (CLogDLL* log = ref.acquire()) {
+    log->LogWrite(1, &trace_level, this_module(), function_name, L"-> %s", display_name);
+  }
 }
 
 trace_scope::~trace_scope() {
   logger_ref ref;
   CLogDLL* log = ref.acquire();
+  if (log == nullptr) return;
   const std::uint32_t elapsed = ::timeGetTime() - start;
   log->LogWrite(-1, &trace_level, this_module(), function_name, L"<- %s [%d]", display_name,
                 static_cast<int>(elapsed));

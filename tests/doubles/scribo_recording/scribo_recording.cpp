@@ -2,6 +2,11 @@
 // ScriboDouble* exports. Lines are formatted with the Microsoft wide printf
 // conventions the component's formats are written for (%s takes a wide
 // string).
+//
+// For tests that look at a process from outside, SCRIBO_DOUBLE_EVENTS_FILE
+// names a file that every library call is also appended to, one per line
+// ("LogInit", "LogWrite:<function>", ...), since the process's memory ends
+// with it; "unload" marks the double's own unloading by FreeLibrary.
 #include <windows.h>
 
 #include <cstdarg>
@@ -19,13 +24,39 @@ struct record {
   HMODULE module;
   std::wstring function;
   std::wstring text;
+  std::wstring format;
 };
 
 std::mutex g_mutex;
 std::deque<record> g_records;  // a deque keeps earlier records in place
 std::wstring g_events;
+volatile DWORD g_init_delay_ms = 0;
+
+// Appends `event` and a line break to SCRIBO_DOUBLE_EVENTS_FILE, when set.
+// Keeps the caller's last error.
+void append_to_events_file(const std::wstring& event) {
+  const DWORD last_error = ::GetLastError();
+  wchar_t path[MAX_PATH + 1] = {};
+  const DWORD n = ::GetEnvironmentVariableW(L"SCRIBO_DOUBLE_EVENTS_FILE", path, MAX_PATH + 1);
+  ::SetLastError(last_error);
+  if (n == 0 || n > MAX_PATH) return;
+  HANDLE file = ::CreateFileW(path, FILE_APPEND_DATA, FILE_SHARE_READ | FILE_SHARE_WRITE, nullptr,
+                              OPEN_ALWAYS, FILE_ATTRIBUTE_NORMAL, nullptr);
+  if (file == INVALID_HANDLE_VALUE) {
+    ::SetLastError(last_error);
+    return;
+  }
+  std::string bytes;
+  for (const wchar_t c : event) bytes += c < 0x80 ? static_cast<char>(c) : '?';
+  bytes += '\n';
+  DWORD written = 0;
+  ::WriteFile(file, bytes.data(), static_cast<DWORD>(bytes.size()), &written, nullptr);
+  ::CloseHandle(file);
+  ::SetLastError(last_error);
+}
 
 void add_event(const std::wstring& event) {
+  append_to_events_file(event);
   std::lock_guard<std::mutex> lock(g_mutex);
   if (!g_events.empty()) g_events += L',';
   g_events += event;
@@ -50,7 +81,10 @@ std::wstring format(const wchar_t* fmt, va_list args) {
 
 extern "C" {
 
-void LogInit() { add_event(L"LogInit"); }
+void LogInit() {
+  if (g_init_delay_ms != 0) ::Sleep(g_init_delay_ms);
+  add_event(L"LogInit");
+}
 void LogDeinit() { add_event(L"LogDeinit"); }
 void LogUninitMetrics() { add_event(L"LogUninitMetrics"); }
 void LogRemoveModule(const char* who) {
@@ -65,8 +99,10 @@ std::int32_t LogWrite(std::int16_t depth, const std::uint32_t* level,
   va_list args;
   va_start(args, fmt);
   record r{depth, level != nullptr ? *level : 0u, module, function != nullptr ? function : L"",
-           fmt != nullptr ? format(fmt, args) : std::wstring()};
+           fmt != nullptr ? format(fmt, args) : std::wstring(),
+           fmt != nullptr ? fmt : L""};
   va_end(args);
+  append_to_events_file(L"LogWrite:" + r.function);
   std::lock_guard<std::mutex> lock(g_mutex);
   g_records.push_back(std::move(r));
   return 0;
@@ -92,6 +128,17 @@ bool ScriboDoubleRead(std::size_t index, std::int16_t* depth,
   return true;
 }
 
+// The format string of line `index`; false past the end.
+bool ScriboDoubleReadFormat(std::size_t index, const wchar_t** format) {
+  std::lock_guard<std::mutex> lock(g_mutex);
+  if (index >= g_records.size()) return false;
+  *format = g_records[index].format.c_str();
+  return true;
+}
+
+// Makes LogInit take `ms` milliseconds, to widen races around binding.
+void ScriboDoubleSetInitDelay(DWORD ms) { g_init_delay_ms = ms; }
+
 void ScriboDoubleClear() {
   std::lock_guard<std::mutex> lock(g_mutex);
   g_records.clear();
@@ -110,3 +157,8 @@ std::size_t ScriboDoubleEvents(wchar_t* buffer, std::size_t capacity) {
 }
 
 }  // extern "C"
+
+BOOL WINAPI DllMain(HINSTANCE /*module*/, DWORD reason, LPVOID reserved) {
+  if (reason == DLL_PROCESS_DETACH && reserved == nullptr) append_to_events_file(L"unload");
+  return TRUE;
+}
