@@ -1,7 +1,10 @@
 // Building buses from a configuration provider through the registry, over the
-// real messaging stand-in. This program has no parlo_ipc.dll beside it, so
-// every gateway build fails at the library load.
+// real messaging stand-in. Built twice: without parlo_ipc.dll beside it, where
+// every gateway build fails at the library load, and with a recording double
+// of it, where the gateway's calls into the library can be read back.
 #include <gtest/gtest.h>
+
+#include <windows.h>
 
 #include "registry/vorbel_impl.h"
 #include "support/config_provider.h"
@@ -10,6 +13,35 @@
 namespace {
 
 using test_support::config_provider;
+
+bool ipc_library_present() {
+  wchar_t path[MAX_PATH];
+  const DWORD n = ::GetModuleFileNameW(nullptr, path, MAX_PATH);
+  std::wstring dll(path, n);
+  dll.resize(dll.find_last_of(L'\\') + 1);
+  dll += L"parlo_ipc.dll";
+  return ::GetFileAttributesW(dll.c_str()) != INVALID_FILE_ATTRIBUTES;
+}
+
+// The recording double's calls since the last take, one per line.
+std::string take_ipc_calls() {
+  HMODULE module = ::GetModuleHandleW(L"parlo_ipc.dll");
+  if (module == nullptr) return "(not loaded)";
+  auto calls = reinterpret_cast<std::size_t (*)(char*, std::size_t)>(
+      reinterpret_cast<void*>(::GetProcAddress(module, "IpcDoubleCalls")));
+  auto clear = reinterpret_cast<void (*)()>(
+      reinterpret_cast<void*>(::GetProcAddress(module, "IpcDoubleClearCalls")));
+  std::string text(calls(nullptr, 0) + 1, '\0');
+  text.resize(calls(text.data(), text.size()));
+  clear();
+  return text;
+}
+
+void set_ipc_result(int which, std::uint32_t result) {
+  HMODULE module = ::GetModuleHandleW(L"parlo_ipc.dll");
+  reinterpret_cast<void (*)(int, std::uint32_t)>(
+      reinterpret_cast<void*>(::GetProcAddress(module, "IpcDoubleSetResult")))(which, result);
+}
 using test_support::has_line;
 
 class build : public ::testing::Test {
@@ -67,6 +99,7 @@ TEST_F(build, local_channels_are_created_in_the_library) {
 }
 
 TEST_F(build, imports_only_are_probed_with_fresh_cursors_and_a_gateway_failure_keeps_the_bus) {
+  if (ipc_library_present()) GTEST_SKIP() << "this build has the IPC library";
   config_provider provider;
   provider.imports = {{"local", "\\\\.\\pipe\\p", "remote", "remote_bus"}};
   ibus* bus = registry.create_bus("importer", &provider);
@@ -82,6 +115,54 @@ TEST_F(build, imports_only_are_probed_with_fresh_cursors_and_a_gateway_failure_k
   ASSERT_EQ(1u, errors.size()) << test_support::dump_log();
   EXPECT_EQ(4u, errors[0].level);
   registry.destroy_bus("importer");
+}
+
+TEST_F(build, one_export_is_probed_then_enumerated_from_the_start_and_exported_once) {
+  if (!ipc_library_present()) GTEST_SKIP() << "needs the recording IPC library";
+  config_provider provider;
+  provider.exports = {{"orders", "\\\\.\\pipe\\orders", false}};  // leaves link type and security alone
+  ibus* bus = registry.create_bus("exporter", &provider);
+  ASSERT_NE(nullptr, bus);
+  EXPECT_NE(nullptr, registry.get_gateway("exporter"));
+  const auto exported = provider.calls_of("exported");
+  ASSERT_EQ(3u, exported.size()) << "the probe, the element, the end";
+  EXPECT_EQ(0u, exported[0].cursor);
+  EXPECT_EQ(0u, exported[1].cursor) << "the real enumeration starts again from the first element";
+  EXPECT_EQ(1u, exported[2].cursor);
+  for (const auto& call : exported) {
+    EXPECT_EQ(3u, call.link_type_in);
+    EXPECT_EQ(0u, call.security_in);
+  }
+  EXPECT_TRUE(provider.calls_of("imported").size() == 1 && provider.calls_of("imported")[0].cursor == 0)
+      << "exports found by the probe: imports are enumerated once, from 0";
+  const std::string calls = take_ipc_calls();
+  EXPECT_EQ(1u, calls.find("export orders \\\\.\\pipe\\orders 3\n") != std::string::npos ? 1u : 0u) << calls;
+  EXPECT_EQ(std::string::npos, calls.find("export orders", calls.find("export orders") + 1))
+      << "exported exactly once: " << calls;
+  EXPECT_NE(std::string::npos, calls.find("start\n"));
+  registry.destroy_bus("exporter");
+  EXPECT_EQ("stop\ndestroy\n", take_ipc_calls());
+}
+
+TEST_F(build, a_failed_export_stops_before_the_imports_and_keeps_the_bus) {
+  if (!ipc_library_present()) GTEST_SKIP() << "needs the recording IPC library";
+  config_provider provider;
+  provider.exports = {{"orders", "pipe_x", true, 3, 1}};
+  provider.imports = {{"local", "pipe_y", "remote", "remote_bus"}};
+  take_ipc_calls();
+  set_ipc_result(3, 50);
+  ibus* bus = registry.create_bus("failing", &provider);
+  set_ipc_result(3, 0);
+  ASSERT_NE(nullptr, bus);
+  EXPECT_EQ(nullptr, registry.get_gateway("failing"));
+  const auto imported = provider.calls_of("imported");
+  ASSERT_EQ(1u, imported.size()) << "only the probe: the enumeration never started";
+  EXPECT_TRUE(has_line(L"export_channels", L"export channel name=orders on pipe=pipe_x err=50"));
+  const std::string calls = take_ipc_calls();
+  EXPECT_EQ(std::string::npos, calls.find("import ")) << calls;
+  EXPECT_EQ(std::string::npos, calls.find("start")) << calls;
+  EXPECT_NE(std::string::npos, calls.find("destroy")) << calls;
+  registry.destroy_bus("failing");
 }
 
 }  // namespace
