@@ -37,8 +37,8 @@ bool valid_name(const char* name, const char* function, const char* what) {
   }
   const std::size_t length = std::strlen(name);
   if (length == 0 || length > max_name_length) {
-    log_line(level_error, function) << what << " length " << length << " outside 1.."
-                                    << max_name_length;
+    log_line(level_error, function)
+        << what << " length " << length << " outside 1.." << max_name_length;
     return false;
   }
   return true;
@@ -46,8 +46,8 @@ bool valid_name(const char* name, const char* function, const char* what) {
 
 template <typename T>
 std::size_t count_present(const std::vector<T*>& list) {
-  return static_cast<std::size_t>(std::count_if(list.begin(), list.end(),
-                                                [](const T* entry) { return entry != nullptr; }));
+  return static_cast<std::size_t>(
+      std::count_if(list.begin(), list.end(), [](const T* entry) { return entry != nullptr; }));
 }
 
 template <typename T>
@@ -58,10 +58,12 @@ void compact(std::vector<T*>& list) {
 // Keeps parlo.dll loaded for the rest of the process: a delivery thread that
 // tears its own bus down still runs the library's code after the host's
 // destroy_bus has returned, when nothing stops the host from unloading it.
+const char module_anchor = 0;
+
 void pin_this_library() {
   HMODULE self = nullptr;
   if (!::GetModuleHandleExW(GET_MODULE_HANDLE_EX_FLAG_FROM_ADDRESS | GET_MODULE_HANDLE_EX_FLAG_PIN,
-                            reinterpret_cast<LPCWSTR>(&pin_this_library), &self)) {
+                            reinterpret_cast<LPCWSTR>(&module_anchor), &self)) {
     const DWORD error = ::GetLastError();
     log_line(level_warning, "parlo::destroy_bus") << "GetModuleHandleEx err=" << error;
   }
@@ -99,9 +101,7 @@ std::uint32_t channel_impl::subscription_count() { return bus_.subscription_coun
 
 std::uint32_t channel_impl::reserved_4() { return error_not_implemented; }
 
-parlo::subscription* channel_impl::create_subscription() {
-  return bus_.create_subscription(*this);
-}
+parlo::subscription* channel_impl::create_subscription() { return bus_.create_subscription(*this); }
 
 std::uint32_t channel_impl::destroy_subscription(parlo::subscription* subscription) {
   return bus_.destroy_subscription(*this, subscription);
@@ -295,7 +295,7 @@ std::uint32_t bus_impl::enqueue(channel_impl& channel, message_impl* copy, bool 
   }
   message_impl::destroy(copy);
   log_line(level_error, function) << "channel " << channel.name_ << ": "
-                                  << (result == error_invalid_state   ? "bus is being destroyed"
+                                  << (result == error_invalid_state      ? "bus is being destroyed"
                                       : result == error_not_enough_quota ? "delivery queue is full"
                                                                          : "out of memory");
   return result;
@@ -363,8 +363,8 @@ std::uint32_t bus_impl::listen(subscription_impl& subscription, message_callback
                                void* context, std::uint32_t flags) {
   const char* const function = "parlo::subscription::listen";
   if (callback == nullptr || flags != 0) {
-    log_line(level_error, function) << (callback == nullptr ? "callback is nullptr"
-                                                             : "unknown flags");
+    log_line(level_error, function)
+        << (callback == nullptr ? "callback is nullptr" : "unknown flags");
     return error_invalid_parameter;
   }
   {
@@ -377,8 +377,7 @@ std::uint32_t bus_impl::listen(subscription_impl& subscription, message_callback
       return success;
     }
   }
-  log_line(level_error, function) << "already listening, or bus " << name_
-                                  << " is being destroyed";
+  log_line(level_error, function) << "already listening, or bus " << name_ << " is being destroyed";
   return error_invalid_state;
 }
 
@@ -407,7 +406,8 @@ std::uint32_t bus_impl::tap(const char* channel, ext::tap_callback callback, voi
         target = created.get();
         channels_.emplace(channel, std::move(created));
       }
-      auto entry = std::make_unique<tap_entry>(tap_entry{next_tap_id_, callback, context, posted_seq_});
+      auto entry =
+          std::make_unique<tap_entry>(tap_entry{next_tap_id_, callback, context, posted_seq_});
       tap_channels_.emplace(entry->id, target);
       try {
         target->taps_.push_back(entry.get());
@@ -441,6 +441,7 @@ std::uint32_t bus_impl::untap(std::uint64_t tap_id) {
   const auto it = std::find_if(list.begin(), list.end(), [&](const tap_entry* entry) {
     return entry != nullptr && entry->id == tap_id;
   });
+  if (it == list.end()) return error_not_found;  // the id table and the lists agree
   tap_entry* found = *it;
   if (walking_ == &channel) {
     *it = nullptr;
@@ -480,8 +481,7 @@ std::uint32_t bus_impl::inject(const char* channel, const void* bytes, std::uint
   message_impl* message = nullptr;
   try {
     codec::message_content content;
-    const codec::status decoded =
-        codec::decode(bytes, static_cast<std::size_t>(size), content);
+    const codec::status decoded = codec::decode(bytes, static_cast<std::size_t>(size), content);
     if (decoded != codec::status::ok) {
       log_line(level_error, function) << "channel " << channel << ": undecodable message ("
                                       << codec::status_text(decoded) << ", " << size << " bytes)";
@@ -549,9 +549,8 @@ void bus_impl::run_taps_locked(std::unique_lock<std::mutex>& lock, const queued_
   }
   if (encoded != codec::status::ok) {
     // set_blob keeps every message within the limits; only memory can fail.
-    log_line(level_error, "parlo::bus::deliver") << "channel " << channel.name_
-                                                 << ": taps skip a message: "
-                                                 << codec::status_text(encoded);
+    log_line(level_error, "parlo::bus::deliver")
+        << "channel " << channel.name_ << ": taps skip a message: " << codec::status_text(encoded);
   }
   lock.lock();
   if (encoded != codec::status::ok) return;
@@ -565,8 +564,8 @@ void bus_impl::run_taps_locked(std::unique_lock<std::mutex>& lock, const queued_
     try {
       callback(channel.name_.c_str(), bytes.data(), bytes.size(), context);
     } catch (...) {
-      log_line(level_error, "parlo::bus::deliver") << "a tap of channel " << channel.name_
-                                                   << " threw";
+      log_line(level_error, "parlo::bus::deliver")
+          << "a tap of channel " << channel.name_ << " threw";
     }
     lock.lock();
     running_ = nullptr;
@@ -590,8 +589,8 @@ void bus_impl::run_subscriptions_locked(std::unique_lock<std::mutex>& lock,
     try {
       callback(item.message, context);
     } catch (...) {
-      log_line(level_error, "parlo::bus::deliver") << "a callback of channel " << channel.name_
-                                                   << " threw";
+      log_line(level_error, "parlo::bus::deliver")
+          << "a callback of channel " << channel.name_ << " threw";
     }
     lock.lock();
     subscription->delivered_.fetch_add(1);

@@ -131,7 +131,7 @@ class bus_impl final : public parlo::bus {
     channel_impl* channel;
     message_impl* message;  // library-owned sealed copy
     std::uint64_t seq;
-    bool injected;          // from parlo_inject: no tap sees it
+    bool injected;  // from parlo_inject: no tap sees it
   };
 
   explicit bus_impl(std::string name) : name_(std::move(name)) {}

@@ -44,14 +44,22 @@ bool has_duplicate_names(const message_content& content) {
 
 const char* status_text(status value) noexcept {
   switch (value) {
-    case status::ok: return "ok";
-    case status::truncated: return "truncated";
-    case status::bad_magic: return "bad magic";
-    case status::too_many_fields: return "too many fields";
-    case status::bad_name: return "bad field name";
-    case status::duplicate_name: return "duplicate field name";
-    case status::too_large: return "too large";
-    case status::trailing_bytes: return "trailing bytes";
+    case status::ok:
+      return "ok";
+    case status::truncated:
+      return "truncated";
+    case status::bad_magic:
+      return "bad magic";
+    case status::too_many_fields:
+      return "too many fields";
+    case status::bad_name:
+      return "bad field name";
+    case status::duplicate_name:
+      return "duplicate field name";
+    case status::too_large:
+      return "too large";
+    case status::trailing_bytes:
+      return "trailing bytes";
   }
   return "unknown status";
 }

@@ -51,13 +51,13 @@ struct message_content {
 
 enum class status {
   ok,
-  truncated,         // the input ends inside the header or a field
-  bad_magic,         // not a message of this format
-  too_many_fields,   // more than max_fields
-  bad_name,          // empty, longer than max_name_length, or holds a zero byte
-  duplicate_name,    // two fields of one name
-  too_large,         // over max_content_size or max_encoded_size
-  trailing_bytes,    // bytes after the last field
+  truncated,        // the input ends inside the header or a field
+  bad_magic,        // not a message of this format
+  too_many_fields,  // more than max_fields
+  bad_name,         // empty, longer than max_name_length, or holds a zero byte
+  duplicate_name,   // two fields of one name
+  too_large,        // over max_content_size or max_encoded_size
+  trailing_bytes,   // bytes after the last field
 };
 
 // A short English text for `value`, e.g. "truncated".

@@ -11,8 +11,10 @@ namespace parlo::impl {
 namespace {
 
 static_assert(codec::max_fields == parlo::max_blob_fields, "one limit for the API and the wire");
-static_assert(codec::max_name_length == parlo::max_name_length, "one limit for the API and the wire");
-static_assert(codec::max_content_size == parlo::max_message_size, "one limit for the API and the wire");
+static_assert(codec::max_name_length == parlo::max_name_length,
+              "one limit for the API and the wire");
+static_assert(codec::max_content_size == parlo::max_message_size,
+              "one limit for the API and the wire");
 
 // Live messages by address.
 struct registry {
@@ -95,7 +97,8 @@ const char* message_impl::blob_name(std::uint32_t index) {
 std::uint32_t message_impl::message_id() { return content_.id; }
 
 std::uint32_t message_impl::set_message_id(std::uint32_t id) {
-  if (const std::uint32_t refused = check_writable("parlo::message::set_message_id")) return refused;
+  if (const std::uint32_t refused = check_writable("parlo::message::set_message_id"))
+    return refused;
   content_.id = id;
   return success;
 }
@@ -166,8 +169,8 @@ std::uint32_t message_impl::set_blob(const char* name, const void* data, std::ui
   }
   const std::size_t name_length = std::strlen(name);
   if (name_length == 0 || name_length > max_name_length) {
-    log_line(level_error, function) << "name length " << name_length << " outside 1.."
-                                    << max_name_length;
+    log_line(level_error, function)
+        << "name length " << name_length << " outside 1.." << max_name_length;
     return error_invalid_parameter;
   }
   if (const std::uint32_t refused = check_writable(function)) return refused;

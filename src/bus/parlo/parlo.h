@@ -19,6 +19,13 @@
 // each channel they see the messages in the order in which the posts
 // returned. See parlo_ext.h for the additional exports the IPC library uses.
 //
+// Waiting: destroy_subscription, parlo_untap and destroy_bus wait for a
+// callback of theirs that is running on the delivery thread to return, so
+// the caller must not hold a lock that such a callback takes. From inside a
+// callback of the same bus nothing waits (see each operation); a callback
+// that ends something of another bus waits for that bus's thread, and two
+// buses whose callbacks do this to each other deadlock.
+//
 // Strings are narrow, zero-terminated UTF-8. Names (channels, bus, blob
 // fields) are 1 to max_name_length bytes.
 #pragma once

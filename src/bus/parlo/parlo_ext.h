@@ -88,7 +88,8 @@ using inject_fn = std::uint32_t (*)(parlo::bus* bus, const char* channel, const 
 
 // "parlo_set_log": sends the library's diagnostic lines to `callback` (null:
 // back to OutputDebugString). When it returns, the previous callback is not
-// running and is not called again. The callback must not call parlo_set_log.
+// running and is not called again. The callback must not call back into the
+// library.
 using set_log_fn = void (*)(log_callback callback, void* context);
 
 }  // namespace parlo::ext

@@ -1,5 +1,7 @@
 // The wire form of a message: exact layout, round trips, and refusal of
 // every malformed input without reading past it.
+#include "message_codec.h"
+
 #include <gtest/gtest.h>
 
 #include <cstdint>
@@ -7,8 +9,6 @@
 #include <random>
 #include <string>
 #include <vector>
-
-#include "message_codec.h"
 
 namespace {
 
@@ -52,11 +52,11 @@ TEST(message_codec, layout_is_little_endian_header_then_fields) {
   content.fields.push_back(field("ab", "xyz"));
   content.fields.push_back(field("e", ""));
   const bytes expected = {
-      'P', 'R', 'L', '1',             // magic
-      0x01, 0x02, 0x03, 0x04,         // id
-      0x02, 0x00, 0x00, 0x00,         // two fields
-      0x02, 0x00, 0x03, 0x00, 0x00, 0x00, 'a', 'b', 'x', 'y', 'z',
-      0x01, 0x00, 0x00, 0x00, 0x00, 0x00, 'e',
+      'P',  'R',  'L',  '1',   // magic
+      0x01, 0x02, 0x03, 0x04,  // id
+      0x02, 0x00, 0x00, 0x00,  // two fields
+      0x02, 0x00, 0x03, 0x00, 0x00, 0x00, 'a',  'b',  'x',
+      'y',  'z',  0x01, 0x00, 0x00, 0x00, 0x00, 0x00, 'e',
   };
   EXPECT_EQ(expected, encoded(content));
   EXPECT_EQ(expected.size(), parlo::codec::encoded_size(content));
