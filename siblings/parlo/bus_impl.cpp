@@ -55,18 +55,19 @@ void compact(std::vector<T*>& list) {
   list.erase(std::remove(list.begin(), list.end(), nullptr), list.end());
 }
 
-// Keeps parlo.dll loaded for the rest of the process: a delivery thread that
-// tears its own bus down still runs the library's code after the host's
-// destroy_bus has returned, when nothing stops the host from unloading it.
+// A reference on parlo.dll, held by each bus while its delivery thread may
+// run the library's code: a host that unloads the library with a bus still
+// alive leaks that bus instead of crashing in unmapped code.
 const char module_anchor = 0;
 
-void pin_this_library() {
+winapi::unique_module reference_this_library() {
   HMODULE self = nullptr;
-  if (!::GetModuleHandleExW(GET_MODULE_HANDLE_EX_FLAG_FROM_ADDRESS | GET_MODULE_HANDLE_EX_FLAG_PIN,
+  if (!::GetModuleHandleExW(GET_MODULE_HANDLE_EX_FLAG_FROM_ADDRESS,
                             reinterpret_cast<LPCWSTR>(&module_anchor), &self)) {
     const DWORD error = ::GetLastError();
-    log_line(level_warning, "parlo::destroy_bus") << "GetModuleHandleEx err=" << error;
+    log_line(level_warning, "parlo::create_bus") << "GetModuleHandleEx err=" << error;
   }
+  return winapi::unique_module(self);
 }
 
 }  // namespace
@@ -114,6 +115,7 @@ bus_impl* bus_impl::create(const char* name) {
   bus_impl* bus = nullptr;
   try {
     bus = new bus_impl(name);
+    bus->module_ = reference_this_library();
     bus->thread_ = std::thread(&bus_impl::run, bus);
   } catch (const std::system_error& error) {
     log_line(level_error, "parlo::create_bus") << "delivery thread failed: " << error.what();
@@ -162,10 +164,7 @@ void bus_impl::shut_down() {
     stop_ = true;
     teardown_on_thread_ = from_callback;
   }
-  if (from_callback) {
-    pin_this_library();
-    return;
-  }
+  if (from_callback) return;
   work_cv_.notify_all();
   if (thread_.joinable()) thread_.join();
   delete this;
@@ -523,7 +522,11 @@ void bus_impl::run() {
   if (teardown_on_thread_) {
     // destroy_bus was called from a callback of this bus and returned at
     // once; nobody joins this thread.
+    // This thread still runs the library's code after the host's
+    // destroy_bus has returned: its reference stays taken, and the library
+    // stays loaded for the rest of the process.
     lock.unlock();
+    static_cast<void>(module_.release());
     thread_.detach();
     delete this;
   }

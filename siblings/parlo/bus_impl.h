@@ -28,6 +28,7 @@
 
 #include "bus/parlo/parlo.h"
 #include "bus/parlo/parlo_ext.h"
+#include "platform/handles.h"
 
 namespace parlo::impl {
 
@@ -165,6 +166,7 @@ class bus_impl final : public parlo::bus {
   void run_subscriptions_locked(std::unique_lock<std::mutex>& lock, const queued_message& item);
 
   const std::string name_;
+  winapi::unique_module module_;  // released after thread_ has ended
   std::thread thread_;
 
   std::mutex mutex_;

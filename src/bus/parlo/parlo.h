@@ -158,7 +158,8 @@ class subscription {
   // 4: starts delivery: `callback(message, context)` is called on the
   // delivery thread for every message posted on the channel after listen
   // has returned. `flags` must be 0. 0, or error_invalid_parameter (null
-  // callback, non-zero flags) or error_invalid_state (already listening).
+  // callback, non-zero flags) or error_invalid_state (already listening, or
+  // the bus is being destroyed).
   virtual std::uint32_t listen(message_callback callback, void* context, std::uint32_t flags) = 0;
 
  protected:
@@ -211,8 +212,9 @@ class bus {
   // name), error_invalid_state (bus being destroyed), error_not_enough_memory.
   virtual std::uint32_t create_channel(const char* name) = 0;
   // 3: waits until every message posted on this bus before the call has been
-  // delivered (callbacks and taps returned), at most `timeout_ms`. 0, or
-  // error_timeout, or error_possible_deadlock on the delivery thread.
+  // delivered (callbacks and taps returned), at most `timeout_ms` (INFINITE:
+  // no limit). 0, or error_timeout, error_possible_deadlock on the delivery
+  // thread, error_invalid_state when the bus stopped before.
   virtual std::uint32_t flush(std::uint32_t timeout_ms) = 0;
   // 4: channel `name`, or null when it does not exist (or for a null name).
   virtual channel* get_channel(const char* name) = 0;
@@ -233,8 +235,8 @@ using create_bus_fn = bus* (*)(const char* name);
 // still queued, which are not delivered. Messages the caller created stay
 // the caller's. Null or already destroyed buses are ignored. Called from
 // inside a callback of the same bus it returns at once; the bus is torn down
-// when that callback returns, so the caller must not unload the library
-// before then.
+// when that callback returns, and the library then stays loaded for the rest
+// of the process. A bus never destroyed keeps the library loaded.
 using destroy_bus_fn = void (*)(bus* bus);
 
 }  // namespace parlo
