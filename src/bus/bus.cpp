@@ -139,12 +139,13 @@ bool bus::is_registered_listener(const char* channel, const char* id) {
   return false;
 }
 
-// Publishes a copy of this process's list; the caller holds `mutex_`.
+// Publishes this process's list; the caller holds `mutex_`, which keeps the
+// list still while it is encoded, so no copy of it is needed.
 std::uint32_t bus::publish_locked() {
   if (!service_channel_) return 0;
+  static const listener_list none;
   auto own = listeners_.find(pid_);
-  const listener_list copy = own != listeners_.end() ? own->second : listener_list();
-  return service_channel_->publish_listeners(pid_, copy);
+  return service_channel_->publish_listeners(pid_, own != listeners_.end() ? own->second : none);
 }
 
 std::uint32_t bus::on_listeners_requested() {

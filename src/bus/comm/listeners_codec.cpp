@@ -15,7 +15,12 @@ std::string copy_to_first_zero(const flatbuffers::String* text) {
 }  // namespace
 
 std::vector<std::uint8_t> encode_listeners(std::uint32_t pid, const listener_list& listeners) {
-  flatbuffers::FlatBufferBuilder builder(1024);
+  // At least 1 KB, and room for the whole message up front: a builder that
+  // regrows copies everything built so far each time, which made large
+  // tables cost several times their size.
+  std::size_t expected = 64;
+  for (const listener& item : listeners) expected += item.channel.size() + item.id.size() + 48;
+  flatbuffers::FlatBufferBuilder builder(std::max<std::size_t>(1024, expected));
   std::vector<flatbuffers::Offset<wire::listener>> tables;
   tables.reserve(listeners.size());
   for (const listener& item : listeners) {
@@ -37,8 +42,7 @@ std::vector<std::uint8_t> encode_listeners(std::uint32_t pid, const listener_lis
                                    builder.GetBufferPointer() + builder.GetSize());
 }
 
-bool decode_listeners(const std::uint8_t* data, std::size_t size, std::uint32_t& pid,
-                      listener_list& listeners) {
+bool verify_listeners(const std::uint8_t* data, std::size_t size, std::uint32_t& pid) {
   if (data == nullptr || size == 0) return false;
   flatbuffers::Verifier verifier(data, size, listeners_max_depth, listeners_max_tables,
                                  /* check_alignment */ true);
@@ -46,19 +50,34 @@ bool decode_listeners(const std::uint8_t* data, std::size_t size, std::uint32_t&
   const wire::listeners_message* message = wire::Getlisteners_message(data);
   const auto* items = message->listeners();
   if (items == nullptr) return false;
+  for (const wire::listener* item : *items) {
+    if (item == nullptr || item->channel() == nullptr || item->id() == nullptr) return false;
+  }
+  pid = message->pid();
+  return true;
+}
 
+listener_list read_listeners(const std::uint8_t* data) {
+  const auto* items = wire::Getlisteners_message(data)->listeners();
   std::vector<listener> received;
   received.reserve(items->size());
   for (const wire::listener* item : *items) {
-    if (item == nullptr || item->channel() == nullptr || item->id() == nullptr) return false;
     received.push_back(listener{copy_to_first_zero(item->channel()), copy_to_first_zero(item->id())});
   }
   // Inserting each listener at its sorted place gives the sorted multiset;
   // sorting once does the same in n log n, so a large hostile list cannot
   // wedge the delivery thread.
   std::sort(received.begin(), received.end());
-  pid = message->pid();
-  listeners.assign(std::make_move_iterator(received.begin()), std::make_move_iterator(received.end()));
+  return listener_list(std::make_move_iterator(received.begin()),
+                       std::make_move_iterator(received.end()));
+}
+
+bool decode_listeners(const std::uint8_t* data, std::size_t size, std::uint32_t& pid,
+                      listener_list& listeners) {
+  std::uint32_t read_pid = 0;
+  if (!verify_listeners(data, size, read_pid)) return false;
+  pid = read_pid;
+  listeners = read_listeners(data);
   return true;
 }
 

@@ -17,10 +17,18 @@ constexpr std::size_t listeners_max_tables = 1000000;
 // The finished flatbuffers bytes for `pid` and `listeners` (list order kept).
 std::vector<std::uint8_t> encode_listeners(std::uint32_t pid, const listener_list& listeners);
 
-// Verifies `data` (depth 64, at most 1,000,000 tables, alignment checked) and
-// reads it. False when it fails verification, lacks the listeners vector, or
-// a listener lacks its channel or id: the whole message is then refused.
-// On success `listeners` holds the listeners in listener order.
+// Verifies `data` (depth 64, at most 1,000,000 tables, alignment checked)
+// and reads the publisher's pid. False when it fails verification, lacks the
+// listeners vector, or a listener lacks its channel or id: the whole message
+// is then refused. Allocates nothing, so a receiver can drop a message (its
+// own publication, say) before paying for the list.
+bool verify_listeners(const std::uint8_t* data, std::size_t size, std::uint32_t& pid);
+
+// The listeners of a buffer that verify_listeners accepted, in listener
+// order.
+listener_list read_listeners(const std::uint8_t* data);
+
+// Both steps: false (and `listeners` untouched) when verification refuses.
 bool decode_listeners(const std::uint8_t* data, std::size_t size, std::uint32_t& pid,
                       listener_list& listeners);
 

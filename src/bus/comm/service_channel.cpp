@@ -174,15 +174,15 @@ void service_channel::on_message(parlo::message* message) {
     if (size == 0) line << L"size=0";
     return;
   }
+  const auto* data = static_cast<const std::uint8_t*>(bytes);
   std::uint32_t pid = 0;
-  listener_list listeners;
   // A buffer that fails verification is dropped without a line: a peer could
   // otherwise flood the log.
-  if (!decode_listeners(static_cast<const std::uint8_t*>(bytes), static_cast<std::size_t>(size), pid,
-                        listeners)) {
-    return;
-  }
-  if (pid == own_pid_) return;  // this process's own publication
+  if (!verify_listeners(data, static_cast<std::size_t>(size), pid)) return;
+  // This process's own publication comes back on its own subscription; it is
+  // dropped before the list is built.
+  if (pid == own_pid_) return;
+  listener_list listeners = read_listeners(data);
   observer_->on_remote_listeners(pid, std::move(listeners));
 }
 
