@@ -413,13 +413,17 @@ void guarded(const wchar_t* event, HANDLE pipe, Call&& call) {
 
 }  // namespace
 
+// The sink may set a DACL on the pipe on these two events; the pipe's DACL is
+// protected again afterwards so that the next one applies cleanly under Wine.
 void gateway_impl::raise_listen(HANDLE pipe, const char* name) {
   guarded(L"on_listen", pipe, [&] { sink_->on_listen(pipe, name); });
+  reprotect_dacl(pipe);
 }
 
 bool gateway_impl::raise_local_connect(HANDLE pipe, std::uint32_t pid) {
   bool admitted = false;
   guarded(L"on_local_connect", pipe, [&] { admitted = sink_->on_local_connect(pipe, pid); });
+  if (admitted) reprotect_dacl(pipe);
   return admitted;
 }
 

@@ -1,5 +1,6 @@
 #include "pipe_support.h"
 
+#include <aclapi.h>
 #include <sddl.h>
 
 #include <cstring>
@@ -90,6 +91,24 @@ DWORD make_initial_pipe_security(unique_local& descriptor) {
     return ::GetLastError();
   }
   descriptor.reset(raw_descriptor);
+  return 0;
+}
+
+DWORD reprotect_dacl(HANDLE pipe) {
+  PACL dacl = nullptr;
+  PSECURITY_DESCRIPTOR raw_current = nullptr;
+  const DWORD read = ::GetSecurityInfo(pipe, SE_KERNEL_OBJECT, DACL_SECURITY_INFORMATION,
+                                       /* owner */ nullptr, /* group */ nullptr, &dacl,
+                                       /* sacl */ nullptr, &raw_current);
+  if (read != ERROR_SUCCESS) return read;
+  unique_local current(raw_current);
+  SECURITY_DESCRIPTOR protected_dacl;
+  if (!::InitializeSecurityDescriptor(&protected_dacl, SECURITY_DESCRIPTOR_REVISION) ||
+      !::SetSecurityDescriptorDacl(&protected_dacl, /* present */ TRUE, dacl, /* defaulted */ FALSE) ||
+      !::SetSecurityDescriptorControl(&protected_dacl, SE_DACL_PROTECTED, SE_DACL_PROTECTED) ||
+      !::SetKernelObjectSecurity(pipe, DACL_SECURITY_INFORMATION, &protected_dacl)) {
+    return ::GetLastError();
+  }
   return 0;
 }
 

@@ -37,4 +37,11 @@ using unique_local = winapi::unique_any<local_free_traits>;
 // on a pipe whose current DACL is protected. 0, or the Win32 code.
 DWORD make_initial_pipe_security(unique_local& descriptor);
 
+// Marks the pipe's current DACL protected again. Wine drops the protection
+// whenever SetSecurityInfo sets a DACL, and then crashes in the next
+// SetSecurityInfo on the handle; the component sets one on listen and again on
+// an admitted connection of the same instance. Windows keeps the protection;
+// there this changes nothing. 0, or the Win32 code.
+DWORD reprotect_dacl(HANDLE pipe);
+
 }  // namespace parlo::ipc::impl
