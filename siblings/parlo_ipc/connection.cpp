@@ -36,7 +36,7 @@ struct connection::write_state {
   const unsigned char* next = nullptr;
   std::size_t left = 0;
   std::size_t total = 0;  // bytes taken from the queue's count
-  bool pending = false;
+  bool pending = false;   // a write is with the system
 };
 
 connection::connection(gateway_impl& gateway, winapi::unique_handle pipe,
@@ -119,147 +119,129 @@ void connection::raise_error(std::uint32_t err) {
   }
 }
 
+namespace {
+
+// Starts an overlapped read or write. 0 when it is under way (or already
+// done: its event is set either way), otherwise the Win32 code.
+DWORD issue_read(HANDLE pipe, unsigned char* buffer, DWORD size, OVERLAPPED& ov) {
+  if (::ReadFile(pipe, buffer, size, /* read */ nullptr, &ov)) return 0;
+  const DWORD err = ::GetLastError();
+  return err == ERROR_IO_PENDING ? 0 : err;
+}
+
+DWORD issue_write(HANDLE pipe, const unsigned char* bytes, std::size_t size, OVERLAPPED& ov) {
+  const DWORD chunk = static_cast<DWORD>(std::min<std::size_t>(size, MAXDWORD));
+  if (::WriteFile(pipe, bytes, chunk, /* written */ nullptr, &ov)) return 0;
+  const DWORD err = ::GetLastError();
+  return err == ERROR_IO_PENDING ? 0 : err;
+}
+
+}  // namespace
+
 void connection::run() {
-  if (!usable()) {
-    logging::logger_stream(logging::level_error, log_name())
-        << L"pipe=" << pipe_name_ << L" no wake event";
-    raise_error(ERROR_NOT_ENOUGH_MEMORY);
-    return;
-  }
   winapi::unique_handle read_event = make_event(/* manual_reset */ true);
   const DWORD read_event_err = ::GetLastError();
   winapi::unique_handle write_event = make_event(/* manual_reset */ true);
   const DWORD write_event_err = ::GetLastError();
-  if (!read_event || !write_event) {
-    const DWORD err = !read_event ? read_event_err : write_event_err;
-    logging::logger_stream(logging::level_error, log_name())
-        << L"pipe=" << pipe_name_ << L" CreateEvent err=" << err;
-    raise_error(err);
-    return;
-  }
-
   std::vector<unsigned char> read_buffer;
+  std::uint32_t failure = 0;  // why the loop ended; 0: the gateway stops
+  bool report = false;        // whether `failure` is an error event
   try {
     read_buffer.resize(read_chunk);
   } catch (const std::bad_alloc&) {
-    raise_error(ERROR_NOT_ENOUGH_MEMORY);
-    return;
+    failure = ERROR_NOT_ENOUGH_MEMORY;
   }
+  if (!usable()) failure = ERROR_NOT_ENOUGH_MEMORY;
+  if (!read_event || !write_event) failure = !read_event ? read_event_err : write_event_err;
+  report = failure != 0;
+
   OVERLAPPED read_ov{};
   read_ov.hEvent = read_event.get();
   OVERLAPPED write_ov{};
   write_ov.hEvent = write_event.get();
   write_state writing;
   bool read_pending = false;
-
-  // 0 while running; otherwise why the loop ended. `report` says whether
-  // the reason is an error event.
-  std::uint32_t failure = 0;
-  bool report = false;
-  bool ended = false;
-  auto end_with = [&](std::uint32_t code, bool as_error) {
+  // Ends the loop: `code` 0 for a stop, a peer that went away gives no error
+  // event, anything else does.
+  auto end_with = [&](std::uint32_t code) {
     failure = code;
-    report = as_error;
-    ended = true;
+    report = code != 0 && !peer_gone(code);
   };
 
   try {
-    while (!ended) {
+    while (failure == 0) {
       if (!read_pending) {
-        if (::ReadFile(pipe_.get(), read_buffer.data(), read_chunk, /* read */ nullptr, &read_ov)) {
-          read_pending = true;  // done already; the event is set
-        } else {
-          const DWORD err = ::GetLastError();
-          if (err == ERROR_IO_PENDING) {
-            read_pending = true;
-          } else {
-            end_with(err, !peer_gone(err));
-            break;
-          }
+        if (const DWORD err = issue_read(handle(), read_buffer.data(), read_chunk, read_ov)) {
+          end_with(err);
+          break;
         }
+        read_pending = true;
       }
-      bool have = false;
       bool overflow = false;
+      bool fresh = false;  // a new write to issue
       {
         std::lock_guard<std::mutex> lock(mutex_);
-        overflow = overflow_;
-        if (!overflow && !writing.pending) have = take_write_locked(writing);
-      }
-      if (overflow) {
         // Checked every round: a peer that does not read never completes
         // the write in flight.
-        end_with(ERROR_NOT_ENOUGH_QUOTA, true);
+        overflow = overflow_;
+        if (!overflow && !writing.pending) fresh = take_write_locked(writing);
+      }
+      if (overflow) {
+        end_with(ERROR_NOT_ENOUGH_QUOTA);
         break;
       }
-      if (have) {
-          const DWORD size = static_cast<DWORD>(std::min<std::size_t>(writing.left, MAXDWORD));
-          if (::WriteFile(pipe_.get(), writing.next, size, /* written */ nullptr, &write_ov)) {
-            writing.pending = true;
-          } else {
-            const DWORD err = ::GetLastError();
-            if (err == ERROR_IO_PENDING) {
-              writing.pending = true;
-            } else {
-              end_with(err, !peer_gone(err));
-              break;
-            }
-          }
+      if (fresh) {
+        if (const DWORD err = issue_write(handle(), writing.next, writing.left, write_ov)) {
+          end_with(err);
+          break;
+        }
+        writing.pending = true;
       }
 
       HANDLE waits[4] = {gateway_.stop_event(), wake_event_.get(), read_event.get(), nullptr};
       DWORD count = 3;
       if (writing.pending) waits[count++] = write_event.get();
       const DWORD woke = ::WaitForMultipleObjects(count, waits, /* wait_all */ FALSE, INFINITE);
+      const DWORD wait_err = ::GetLastError();
       if (woke == WAIT_FAILED) {
-        const DWORD err = ::GetLastError();
-        end_with(err, true);
+        end_with(wait_err != 0 ? wait_err : ERROR_GEN_FAILURE);
         break;
       }
-      if (woke == WAIT_OBJECT_0) {
-        end_with(0, false);  // the gateway stops
-        break;
-      }
+      if (woke == WAIT_OBJECT_0) break;  // the gateway stops
 
       if (read_pending && HasOverlappedIoCompleted(&read_ov)) {
         read_pending = false;
         DWORD got = 0;
-        if (!::GetOverlappedResult(pipe_.get(), &read_ov, &got, /* wait */ FALSE)) {
+        if (!::GetOverlappedResult(handle(), &read_ov, &got, /* wait */ FALSE)) {
           const DWORD err = ::GetLastError();
-          end_with(err, !peer_gone(err));
+          end_with(err);
           break;
         }
-        const std::uint32_t err = handle_read(read_buffer.data(), got);
-        if (err != 0) {
-          end_with(err, true);
+        if (const std::uint32_t err = handle_read(read_buffer.data(), got)) {
+          end_with(err);
           break;
         }
       }
       if (writing.pending && HasOverlappedIoCompleted(&write_ov)) {
-        writing.pending = false;
         DWORD put = 0;
-        if (!::GetOverlappedResult(pipe_.get(), &write_ov, &put, /* wait */ FALSE)) {
+        if (!::GetOverlappedResult(handle(), &write_ov, &put, /* wait */ FALSE)) {
           const DWORD err = ::GetLastError();
-          end_with(err, !peer_gone(err));
+          writing.pending = false;
+          end_with(err);
           break;
         }
         const std::size_t done = std::min<std::size_t>(put, writing.left);
         writing.next += done;
         writing.left -= done;
         if (writing.left > 0) {
-          // A short write: the rest goes next round, without taking more.
-          const DWORD size = static_cast<DWORD>(std::min<std::size_t>(writing.left, MAXDWORD));
-          if (::WriteFile(pipe_.get(), writing.next, size, /* written */ nullptr, &write_ov)) {
-            writing.pending = true;
-          } else {
-            const DWORD err = ::GetLastError();
-            if (err == ERROR_IO_PENDING) {
-              writing.pending = true;
-            } else {
-              end_with(err, !peer_gone(err));
-              break;
-            }
+          // A short write: the rest goes at once, before anything else.
+          if (const DWORD err = issue_write(handle(), writing.next, writing.left, write_ov)) {
+            writing.pending = false;
+            end_with(err);
+            break;
           }
         } else {
+          writing.pending = false;
           std::lock_guard<std::mutex> lock(mutex_);
           queued_bytes_ -= std::min<std::uint64_t>(queued_bytes_, writing.total);
           writing.large.reset();
@@ -267,15 +249,15 @@ void connection::run() {
       }
     }
   } catch (const std::bad_alloc&) {
-    end_with(ERROR_NOT_ENOUGH_MEMORY, true);
+    end_with(ERROR_NOT_ENOUGH_MEMORY);
   }
 
   // The buffers must outlive every operation the system still holds.
   if (read_pending || writing.pending) {
-    ::CancelIoEx(pipe_.get(), /* overlapped */ nullptr);
+    ::CancelIoEx(handle(), /* overlapped */ nullptr);
     DWORD ignored = 0;
-    if (read_pending) ::GetOverlappedResult(pipe_.get(), &read_ov, &ignored, /* wait */ TRUE);
-    if (writing.pending) ::GetOverlappedResult(pipe_.get(), &write_ov, &ignored, /* wait */ TRUE);
+    if (read_pending) ::GetOverlappedResult(handle(), &read_ov, &ignored, /* wait */ TRUE);
+    if (writing.pending) ::GetOverlappedResult(handle(), &write_ov, &ignored, /* wait */ TRUE);
   }
   close_queue();
 

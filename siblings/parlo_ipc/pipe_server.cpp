@@ -237,6 +237,7 @@ void pipe_server::accept(winapi::unique_handle instance) {
     return;
   }
   std::shared_ptr<server_connection> link;
+  bool routed = false;
   try {
     link = std::make_shared<server_connection>(gateway_, std::move(instance), *this);
     // The hello goes first; frames the tap queues from now on follow it but
@@ -246,18 +247,22 @@ void pipe_server::accept(winapi::unique_handle instance) {
       std::lock_guard<std::mutex> lock(mutex_);
       routed_.push_back(link);
     }
+    routed = true;
     workers_.emplace_back();
+    workers_.back().link = link;
     worker& work = workers_.back();
-    work.link = link;
-    work.thread = std::thread([this, &work] { serve(work); });
+    try {
+      work.thread = std::thread([this, &work] { serve(work); });
+    } catch (...) {
+      workers_.pop_back();
+      throw;
+    }
   } catch (const std::exception& e) {
     logging::logger_stream(logging::level_error, L"parlo_ipc::pipe_server::accept")
         << L"pipe=" << config_.name << L" a client cannot be served: " << e.what();
-    if (link) {
-      unroute(link);
-      link->close_handle();
-    }
-    if (!workers_.empty() && !workers_.back().thread.joinable()) workers_.pop_back();
+    if (routed) unroute(link);
+    // No event was raised for it: the client just sees its pipe closed.
+    if (link) link->close_handle();
   }
 }
 
