@@ -68,6 +68,9 @@ class gateway_observer final : public parlo::ipc::gateway::events {
   // Called by the gateway's start, before the IPC library starts.
   void set_pipe_security_map(pipe_security_map map) { pipe_security_ = std::move(map); }
 
+  // Processes whose trust is cached (until they exit or are trimmed).
+  std::size_t trusted_process_count() const { return trust_cache_.size(); }
+
   // For tests and diagnostics: runs `probe` on the worker after every task
   // posted so far, and waits for it.
   void run_on_worker(const std::function<void(connections_cache&)>& probe);
