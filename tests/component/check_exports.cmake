@@ -1,0 +1,30 @@
+# Checks what vorbel.dll offers and needs: exactly the three exports by their
+# undecorated names, and imports of Windows system DLLs only (no mingw
+# runtime DLL may be needed beside it).
+execute_process(COMMAND ${OBJDUMP} -p ${DLL} OUTPUT_VARIABLE dump RESULT_VARIABLE rc)
+if(NOT rc EQUAL 0)
+  message(FATAL_ERROR "objdump failed on ${DLL}")
+endif()
+# The export names are listed after "[Ordinal/Name Pointer] Table", up to
+# the next blank line.
+string(FIND "${dump}" "[Ordinal/Name Pointer] Table" at)
+if(at LESS 0)
+  message(FATAL_ERROR "${DLL} exports nothing")
+endif()
+string(SUBSTRING "${dump}" ${at} -1 table)
+string(FIND "${table}" "\n\n" end)
+string(SUBSTRING "${table}" 0 ${end} table)
+string(REGEX MATCHALL "\\[ *[0-9]+\\] [A-Za-z_][A-Za-z0-9_@]*" exports "${table}")
+string(REGEX REPLACE "\\[ *[0-9]+\\] " "" exports "${exports}")
+list(SORT exports)
+if(NOT exports STREQUAL "QmCreateObject;QmDestroyObject;QmGetInterface")
+  message(FATAL_ERROR "exports of ${DLL}: ${exports}")
+endif()
+string(REGEX MATCHALL "DLL Name: [^\n]+" imports "${dump}")
+foreach(import IN LISTS imports)
+  string(TOLOWER "${import}" lower)
+  if(lower MATCHES "libstdc|libgcc|winpthread|libwinpthread")
+    message(FATAL_ERROR "${DLL} needs a mingw runtime DLL: ${import}")
+  endif()
+endforeach()
+message(STATUS "exports: ${exports}; ${imports}")
