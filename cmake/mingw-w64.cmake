@@ -9,7 +9,10 @@ set(CMAKE_RC_COMPILER  ${_triple}-windres)
 set(CMAKE_AR           /usr/bin/${_triple}-ar CACHE FILEPATH "")
 set(CMAKE_RANLIB       /usr/bin/${_triple}-ranlib CACHE FILEPATH "")
 
-set(CMAKE_FIND_ROOT_PATH /usr/${_triple})
+# Trees named in CMAKE_PREFIX_PATH hold Windows binaries for this target (an
+# installed vorbel package, for a host project): they are roots too, or the
+# rules below would look for them under the mingw tree only.
+set(CMAKE_FIND_ROOT_PATH /usr/${_triple} ${CMAKE_PREFIX_PATH})
 set(CMAKE_FIND_ROOT_PATH_MODE_PROGRAM NEVER)
 set(CMAKE_FIND_ROOT_PATH_MODE_LIBRARY ONLY)
 set(CMAKE_FIND_ROOT_PATH_MODE_INCLUDE ONLY)
