@@ -50,9 +50,16 @@ bool verify_listeners(const std::uint8_t* data, std::size_t size, std::uint32_t&
   const wire::listeners_message* message = wire::Getlisteners_message(data);
   const auto* items = message->listeners();
   if (items == nullptr) return false;
+  // A publisher writes every string once, so its listeners' strings together
+  // never outgrow the buffer. Entries that all refer to one table or string
+  // still verify, and would make a message of a few hundred kilobytes expand
+  // into gigabytes of copies on the receiving thread.
+  std::uint64_t text_bytes = 0;
   for (const wire::listener* item : *items) {
     if (item == nullptr || item->channel() == nullptr || item->id() == nullptr) return false;
+    text_bytes += std::uint64_t{item->channel()->size()} + item->id()->size();
   }
+  if (text_bytes > size) return false;
   pid = message->pid();
   return true;
 }

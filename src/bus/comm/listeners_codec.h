@@ -19,9 +19,10 @@ std::vector<std::uint8_t> encode_listeners(std::uint32_t pid, const listener_lis
 
 // Verifies `data` (depth 64, at most 1,000,000 tables, alignment checked)
 // and reads the publisher's pid. False when it fails verification, lacks the
-// listeners vector, or a listener lacks its channel or id: the whole message
-// is then refused. Allocates nothing, so a receiver can drop a message (its
-// own publication, say) before paying for the list.
+// listeners vector, a listener lacks its channel or id, or the listeners'
+// strings together are longer than the buffer (entries sharing strings): the
+// whole message is then refused. Allocates nothing, so a receiver can drop a
+// message (its own publication, say) before paying for the list.
 bool verify_listeners(const std::uint8_t* data, std::size_t size, std::uint32_t& pid);
 
 // The listeners of a buffer that verify_listeners accepted, in listener

@@ -154,4 +154,46 @@ TEST(listeners_codec, a_large_unsorted_list_decodes_in_reasonable_time) {
   EXPECT_TRUE(std::is_sorted(got.begin(), got.end()));
 }
 
+// Found by fuzzing. The four vector entries refer to one listener table,
+// whose channel and id refer to one string: it verifies, yet reading it
+// copies 80 bytes of text out of 76. Scaled up (100,000 entries, one 10 KB
+// string: a 410 KB message), a receiver spent 14 s and 2 GB building the list.
+TEST(listeners_codec, entries_sharing_one_string_are_refused) {
+  const std::vector<std::uint8_t> shared = {
+      0x04, 0x00, 0x00, 0x00,  // root table at 4
+      0xe0, 0xff, 0xff, 0xff,  // root table: its vtable at 4 + 32
+      0x05, 0xff, 0xff, 0x00,  // pid
+      0x04, 0x00, 0x00, 0x00,  // listeners: the vector at 16
+      0x04, 0x00, 0x00, 0x00,  // vector: 4 entries, each to the table at 44
+      0x18, 0x00, 0x00, 0x00, 0x14, 0x00, 0x00, 0x00, 0x10, 0x00, 0x00, 0x00, 0x0c, 0x00, 0x00, 0x00,
+      0x08, 0x00, 0x0c, 0x00, 0x04, 0x00, 0x08, 0x00,  // vtable of both tables: fields at 4 and 8
+      0x08, 0x00, 0x00, 0x00,  // listener table at 44: its vtable at 44 - 8
+      0x0c, 0x00, 0x00, 0x00,  // channel: the string at 60
+      0x08, 0x00, 0x00, 0x00,  // id: the same string
+      0x13, 0x00, 0x00, 0x00,  // unused
+      0x0b, 0x00, 0x00, 0x00,  // string at 60: 11 bytes
+      0xff, 0xff, 0xff, 0xff, 0x63, 0x63, 0x63, 0x63, 0x63, 0x62, 0x00,
+      0x00,  // its terminator
+  };
+  std::uint32_t pid = 0;
+  listener_list out;
+  EXPECT_FALSE(comm::verify_listeners(shared.data(), shared.size(), pid));
+  EXPECT_FALSE(decode_listeners(shared.data(), shared.size(), pid, out));
+  EXPECT_TRUE(out.empty());
+
+  const auto share = [](std::size_t entries, const std::string& text) {
+    flatbuffers::FlatBufferBuilder builder;
+    const auto string = builder.CreateString(text);
+    const auto table = comm::wire::Createlistener(builder, string, string);
+    const std::vector<flatbuffers::Offset<comm::wire::listener>> items(entries, table);
+    return finish(builder, comm::wire::Createlisteners_message(builder, 5, builder.CreateVector(items)));
+  };
+  // Sharing that copies no more than was sent is still read.
+  const auto small = share(4, "ab");
+  EXPECT_EQ(4u, decode_ok(small, pid).size());
+  const auto large = share(20000, std::string(1000, 'c'));
+  EXPECT_FALSE(decode_listeners(large.data(), large.size(), pid, out)) << "40 MB of copies from 81 KB";
+  EXPECT_TRUE(out.empty());
+}
+
 }  // namespace
