@@ -14,4 +14,11 @@ rc=0
 ctest --test-dir "$BUILD_DIR" --output-on-failure -j2 || rc=$?
 end=$(date +%s.%N)
 awk -v s="$start" -v e="$end" 'BEGIN { printf "== test run wall time: %.1f s\n", e - s }'
+
+# A short fuzz run of the byte decoders (native clang build, ~10 s a target);
+# a crash fails the run and its input stays under build-fuzz/artifacts/.
+if command -v clang++-14 >/dev/null 2>&1; then
+  echo "== fuzz smoke run"
+  "$ROOT/scripts/fuzz.sh" 10 || rc=1
+fi
 exit "$rc"
