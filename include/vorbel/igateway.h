@@ -24,10 +24,12 @@ inline constexpr GUID IID_igateway_observer = {
 struct igateway_observer_base : IQmBaseInterface {};
 
 // Connection notifications, called on the gateway's own notification thread,
-// one at a time, in the order the pipe events happened. `name` is the pipe's
-// name as read from its handle (a backslash and the pipe's own name; empty
-// when unknown), never null. "local" events are about pipes this process
-// serves, "remote" events about pipes it opened to other processes.
+// one at a time, in the order the pipe events happened. `name` is never
+// null. For on_listen it is the name the IPC library gave with the event
+// (empty when it gave none); for the other events it is the pipe's name as
+// read from its handle (a backslash and the pipe's own name; empty when
+// unknown). "local" events are about pipes this process serves, "remote"
+// events about pipes it opened to other processes.
 struct igateway_observer : igateway_observer_base {
   virtual void on_listen(const char* name) = 0;
   virtual void on_local_connect(const char* name, std::uint32_t pid) = 0;

@@ -3,9 +3,9 @@
 //
 // Every LogWrite call becomes one line:
 //
-//   2026-05-01 12:34:56.788 [1234:5678] TRACE gateway::start: -> gateway::start()
-//   2026-05-01 12:34:56.789 [1234:5678] INFO    gateway::start: pipe name: bus_a
-//   2026-05-01 12:34:56.790 [1234:5678] TRACE gateway::start: <- gateway::start() [2]
+//   2026-05-01 12:34:56.788 [1234:5678] TRACE gateway::export_channel: -> gateway::export_channel()
+//   2026-05-01 12:34:56.789 [1234:5678] INFO    gateway::export_channel: channel=alerts link_type=3 security=0
+//   2026-05-01 12:34:56.790 [1234:5678] TRACE gateway::export_channel: <- gateway::export_channel() [2]
 //
 // local time to the millisecond, process and thread id, the level's name,
 // two blanks per traced operation the calling thread is inside (the depth
