@@ -79,6 +79,18 @@ TEST(listeners_codec, a_received_list_is_put_in_listener_order) {
   EXPECT_EQ(expected, decode_ok(bytes, pid));
 }
 
+TEST(listeners_codec, a_list_in_order_up_to_its_last_entry_is_still_sorted) {
+  // A list that arrives in order is taken as it is; one out of place at the
+  // very end, or one equal pair among ordered neighbours, must still come
+  // out sorted and whole.
+  const listener_list late = {{"a", "1"}, {"a", "1"}, {"b", "2"}, {"c", "3"}, {"a", "0"}};
+  std::uint32_t pid = 0;
+  const listener_list expected = {{"a", "0"}, {"a", "1"}, {"a", "1"}, {"b", "2"}, {"c", "3"}};
+  EXPECT_EQ(expected, decode_ok(encode_listeners(4, late), pid));
+  const listener_list ordered = {{"a", "0"}, {"a", "1"}, {"a", "1"}, {"b", "2"}, {"c", "3"}};
+  EXPECT_EQ(ordered, decode_ok(encode_listeners(4, ordered), pid));
+}
+
 TEST(listeners_codec, strings_are_cut_at_their_first_zero_byte) {
   const listener_list sent = {{std::string("chan\0nel", 8), std::string("i\0d", 3)}};
   std::uint32_t pid = 0;
