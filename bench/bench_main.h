@@ -1,0 +1,25 @@
+// The subcommands of vorbel_bench. Each prints a markdown section on
+// standard output and returns the process exit code (0, or 1 when the
+// benchmark could not run; a missed goal is reported, not an error).
+#pragma once
+
+#include <cstddef>
+#include <string>
+#include <vector>
+
+namespace bench {
+
+int run_transport();
+int run_propagation();
+int run_convergence(const std::vector<std::size_t>& sizes);
+int run_codec();
+int run_admission();
+int run_local();
+// The peer role (peer.cpp).
+int run_peer();
+
+// "SCRIBO_LOG_LEVEL=off", or how the logging library is set up when the
+// variable is not set, for the reports.
+std::string logging_setting();
+
+}  // namespace bench
