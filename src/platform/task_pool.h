@@ -2,18 +2,24 @@
 //
 // The owner constructs and destroys the pool; any thread may post. Tasks run
 // on the worker only, one at a time, in the order in which posts took the
-// mutex. Destruction lets the running task finish and drops the queued ones
+// lock. Destruction lets the running task finish and drops the queued ones
 // unrun, so a task must not rely on a later one to clean up after it.
+//
+// The queue is guarded by a slim reader/writer lock and the worker sleeps on
+// a system condition variable: with the mingw-w64 runtime the standard mutex
+// and condition variable go through kernel semaphores, and each hand-off to
+// the worker cost about 15 times as much (measured under Wine: 144 against
+// 10 microseconds), on the path of every listener notification.
 #pragma once
 
+#include <windows.h>
+
 #include <atomic>
-#include <condition_variable>
 #include <cstdio>
 #include <cstdlib>
 #include <deque>
 #include <exception>
 #include <functional>
-#include <mutex>
 #include <thread>
 #include <utility>
 
@@ -29,7 +35,7 @@ class task_pool {
     running_ = true;
     // Held while the worker starts, so that the worker sees worker_ assigned
     // before it can run a task that asks on_worker_thread().
-    std::lock_guard<std::mutex> lock(mutex_);
+    exclusive lock(lock_);
     worker_ = std::thread(&task_pool::worker, this);
   }
   task_pool(const task_pool&) = delete;
@@ -42,17 +48,17 @@ class task_pool {
       std::abort();
     }
     {
-      std::lock_guard<std::mutex> lock(mutex_);
+      exclusive lock(lock_);
       running_ = false;
-      wake_.notify_all();
+      ::WakeAllConditionVariable(&wake_);
     }
     worker_.join();
   }
 
   void post(std::function<void()> task) {
-    std::lock_guard<std::mutex> lock(mutex_);
+    exclusive lock(lock_);
     queue_.push_back(std::move(task));
-    wake_.notify_one();
+    ::WakeConditionVariable(&wake_);
   }
 
   // True on the worker thread; pool-only code asserts it.
@@ -63,10 +69,22 @@ class task_pool {
   bool stopping() const { return !running_; }
 
  private:
+  // Holds `lock_` exclusively for a scope.
+  class exclusive {
+   public:
+    explicit exclusive(SRWLOCK& lock) : lock_(lock) { ::AcquireSRWLockExclusive(&lock_); }
+    exclusive(const exclusive&) = delete;
+    exclusive& operator=(const exclusive&) = delete;
+    ~exclusive() { ::ReleaseSRWLockExclusive(&lock_); }
+
+   private:
+    SRWLOCK& lock_;
+  };
+
   // An empty task when the pool stops, even if tasks remain.
   std::function<void()> next_task() {
-    std::unique_lock<std::mutex> lock(mutex_);
-    wake_.wait(lock, [this] { return !running_ || !queue_.empty(); });
+    exclusive lock(lock_);
+    while (running_ && queue_.empty()) ::SleepConditionVariableSRW(&wake_, &lock_, INFINITE, 0);
     if (!running_) return {};
     std::function<void()> task = std::move(queue_.front());
     queue_.pop_front();
@@ -92,8 +110,8 @@ class task_pool {
   }
 
   std::deque<std::function<void()>> queue_;
-  std::mutex mutex_;
+  SRWLOCK lock_ = SRWLOCK_INIT;
   std::thread worker_;
   std::atomic<bool> running_{false};
-  std::condition_variable wake_;
+  CONDITION_VARIABLE wake_ = CONDITION_VARIABLE_INIT;
 };
