@@ -48,6 +48,8 @@ run() {
   local started=$SECONDS rc=0
   (cd "$RUN_DIR" && timeout "$limit" "$WINE" "$RUN_DIR/../bin/vorbel_bench.exe" "$@" \
     >"$RUN_DIR/$name.md" 2>"$RUN_DIR/$name.err") || rc=$?
+  # The program's standard output is in text mode: lines end in CR LF.
+  sed -i 's/\r$//' "$RUN_DIR/$name.md"
   if [ $rc -ne 0 ]; then
     printf '\n**%s did not complete** (exit code %s%s); see %s.\n\n' "$name" "$rc" \
       "$([ $rc -eq 124 ] && echo ", stopped after $limit s")" "$name.err" >>"$RUN_DIR/$name.md"
