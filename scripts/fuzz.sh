@@ -47,6 +47,15 @@ if [ ${#missing[@]} -gt 0 ]; then
   fi
 fi
 
+# One run at a time per tree: a second one would rebuild the binaries, rewrite
+# the seeds and write into the same logs and corpus under the first.
+mkdir -p "$FUZZ_BUILD_DIR"
+exec 9>"$FUZZ_BUILD_DIR/.fuzz.lock"
+if ! flock -n 9; then
+  echo "== waiting for the fuzz run already using $FUZZ_BUILD_DIR"
+  flock 9
+fi
+
 echo "== fuzz build in $FUZZ_BUILD_DIR"
 CC=clang-14 CXX=clang++-14 cmake -S "$ROOT/fuzz" -B "$FUZZ_BUILD_DIR" -G Ninja >/dev/null
 cmake --build "$FUZZ_BUILD_DIR" --target fuzz_seeds "${TARGETS[@]}"
@@ -101,7 +110,7 @@ for target in "${TARGETS[@]}"; do
   per_second=$(stat_of "$log" average_exec_per_sec)
   peak_rss=$(stat_of "$log" peak_rss_mb)
   corpus_files=$(find "$corpus" -type f | wc -l)
-  corpus_kb=$(du -sk "$corpus" | cut -f1)
+  corpus_kb=$(( $(du -sb "$corpus" | cut -f1) / 1024 ))
   summary+=("$(printf '%-22s %12s %8s %8s %10s %8s %9s' "$target" "${executions:-?}" "${per_second:-?}" \
     "$crashes" "${peak_rss:-?} MB" "$corpus_files" "${corpus_kb} KB")")
 

@@ -15,10 +15,11 @@ ctest --test-dir "$BUILD_DIR" --output-on-failure -j2 || rc=$?
 end=$(date +%s.%N)
 awk -v s="$start" -v e="$end" 'BEGIN { printf "== test run wall time: %.1f s\n", e - s }'
 
-# A short fuzz run of the byte decoders (native clang build, ~10 s a target);
-# a crash fails the run and its input stays under build-fuzz/artifacts/.
+# A short fuzz run of the byte decoders (native clang build beside this one,
+# ~10 s a target); a crash fails the run and its input stays under
+# <build dir>-fuzz/artifacts/.
 if command -v clang++-14 >/dev/null 2>&1; then
   echo "== fuzz smoke run"
-  "$ROOT/scripts/fuzz.sh" 10 || rc=1
+  FUZZ_BUILD_DIR="${FUZZ_BUILD_DIR:-$BUILD_DIR-fuzz}" "$ROOT/scripts/fuzz.sh" 10 || rc=1
 fi
 exit "$rc"
