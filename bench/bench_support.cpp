@@ -2,7 +2,16 @@
 
 #include <cstdio>
 
+#include "bench_main.h"
+
 namespace bench {
+
+std::string logging_setting() {
+  wchar_t value[64];
+  const DWORD n = ::GetEnvironmentVariableW(L"SCRIBO_LOG_LEVEL", value, 64);
+  if (n == 0 || n >= 64) return "SCRIBO_LOG_LEVEL unset: every line, trace included, is written";
+  return "SCRIBO_LOG_LEVEL=" + std::string(value, value + n);
+}
 
 std::int64_t now_ticks() {
   LARGE_INTEGER now;

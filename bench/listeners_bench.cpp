@@ -320,9 +320,12 @@ int run_convergence(const std::vector<std::size_t>& sizes) {
                 r.converged ? format("%.0f ms", r.converge_ms).c_str() : "-");
   }
   for (const row& r : rows) {
-    if (r.service.publications != r.n) {
-      std::printf("- N = %zu: B received %llu publications for %zu registrations\n", r.n, r.service.publications,
-                  r.n);
+    if (r.service.publications != r.n || r.service.removed != 0) {
+      std::printf("- N = %zu: B received %llu publications for %zu registrations and heard %llu listeners "
+                  "of A removed%s\n",
+                  r.n, r.service.publications, r.n, r.service.removed,
+                  r.service.removed != 0 ? ": the gateway dropped the connection and B joined again (see the notes below)"
+                                         : "");
     }
   }
   std::printf("\n");

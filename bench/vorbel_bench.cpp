@@ -20,13 +20,6 @@
 
 namespace bench {
 
-std::string logging_setting() {
-  wchar_t value[64];
-  const DWORD n = ::GetEnvironmentVariableW(L"SCRIBO_LOG_LEVEL", value, 64);
-  if (n == 0 || n >= 64) return "SCRIBO_LOG_LEVEL unset: every line, trace included, is written";
-  return "SCRIBO_LOG_LEVEL=" + std::string(value, value + n);
-}
-
 int run_codec() {
   const auto rows = run_codec_bench({1, 10, 100, 1000});
   std::fputs(codec_markdown("mingw-w64 under Wine", rows).c_str(), stdout);

@@ -102,7 +102,7 @@ goals() {
   echo "# Benchmarks"
   echo
   echo "Written by \`scripts/bench.sh\` on $(date -u '+%Y-%m-%d %H:%M UTC'): $(nproc) cores, load average" \
-    "$load_before before the run and $load_after after it, $(wine64 --version 2>/dev/null || echo Wine)," \
+    "$load_before before the run and $load_after after it, $("$WINE" --version 2>/dev/null || echo Wine)," \
     "$(x86_64-w64-mingw32-g++-posix -dumpfullversion 2>/dev/null | sed 's/^/mingw-w64 g++ /')," \
     "RelWithDebInfo (-O2). Timing runs set \`SCRIBO_LOG_LEVEL=off\` (the component still formats its" \
     "lines; the logging library drops them). Process A is \`vorbel_bench\`, process B the same program" \
@@ -117,7 +117,8 @@ goals() {
   echo
   goals
   grep -h '^| [0-9]* B |' "$RUN_DIR/transport.md" 2>/dev/null |
-    awk -F'|' '{gsub(/ /, "", $2); printf "- transport %s: bus p50 / raw p50 = %s (goal <= 1.5): %s; bus p99 %s us (goal < 2 ms): %s\n", $2, $9, $11, $7, $12}' || true
+    awk -F'|' '{for (i = 2; i <= 12; i++) gsub(/^ +| +$/, "", $i);
+      printf "- transport %s: bus p50 / raw p50 = %s (goal <= 1.5): %s; bus p99 %s µs (goal < 2 ms): %s\n", $2, $9, $11, $7, $12}' || true
   echo
   cat "$RUN_DIR/transport.md" "$RUN_DIR/propagation.md"
   echo "### Propagation with every log line written"
