@@ -50,6 +50,10 @@ bool verify_listeners(const std::uint8_t* data, std::size_t size, std::uint32_t&
   const wire::listeners_message* message = wire::Getlisteners_message(data);
   const auto* items = message->listeners();
   if (items == nullptr) return false;
+  // A publisher's entry takes at least 32 bytes (its offset, its table, two
+  // strings); entries that share tables would let a small buffer expand into
+  // a list many times its size. Half that still leaves room for any encoder.
+  if (items->size() > size / 16) return false;
   // A publisher writes every string once, so its listeners' strings together
   // never outgrow the buffer. Entries that all refer to one table or string
   // still verify, and would make a message of a few hundred kilobytes expand

@@ -182,8 +182,14 @@ void service_channel::on_message(parlo::message* message) {
   // This process's own publication comes back on its own subscription; it is
   // dropped before the list is built.
   if (pid == own_pid_) return;
-  listener_list listeners = read_listeners(data);
-  observer_->on_remote_listeners(pid, std::move(listeners));
+  // This runs on the messaging library's delivery thread: nothing may
+  // escape it, or the process ends.
+  try {
+    observer_->on_remote_listeners(pid, read_listeners(data));
+  } catch (const std::exception& e) {
+    logger_stream(level_error, L"comm::service_channel::on_message")
+        << L"listeners message of pid=" << pid << L" dropped: " << e.what();
+  }
 }
 
 }  // namespace comm

@@ -206,6 +206,12 @@ TEST(listeners_codec, entries_sharing_one_string_are_refused) {
   const auto large = share(20000, std::string(1000, 'c'));
   EXPECT_FALSE(decode_listeners(large.data(), large.size(), pid, out)) << "40 MB of copies from 81 KB";
   EXPECT_TRUE(out.empty());
+  // Empty strings copy nothing, but a shared table still turns 4 bytes of
+  // vector into a list entry of a hundred.
+  const auto empty = share(100000, "");
+  EXPECT_FALSE(decode_listeners(empty.data(), empty.size(), pid, out)) << "100,000 entries in "
+                                                                        << empty.size() << " bytes";
+  EXPECT_TRUE(out.empty());
 }
 
 }  // namespace
