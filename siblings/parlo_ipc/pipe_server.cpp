@@ -165,6 +165,7 @@ void pipe_server::listen() {
       announced = false;
     }
     if (!announced) {
+      std::lock_guard<std::mutex> lock(dacl_mutex_);
       gateway_.raise_listen(instance.get(), config_.name.c_str());
       announced = true;
     }
@@ -277,6 +278,7 @@ void pipe_server::serve(worker& work) {
         << L"pipe=" << config_.name << L" handle=" << link.handle()
         << L" GetNamedPipeClientProcessId err=" << err;
   } else {
+    std::lock_guard<std::mutex> lock(dacl_mutex_);
     admitted = gateway_.raise_local_connect(link.handle(), pid);
   }
   if (!admitted) {

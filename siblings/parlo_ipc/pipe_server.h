@@ -102,6 +102,14 @@ class pipe_server {
 
   std::mutex mutex_;  // guards routed_
   std::vector<std::shared_ptr<server_connection>> routed_;
+
+  // Held through each event that may set the pipe's DACL (on_listen,
+  // on_local_connect) and the re-protection after it. Under Wine every
+  // instance of a pipe name shares one security descriptor: a DACL set on
+  // the next instance while a client's admission sets one on its own would
+  // leave the descriptor unprotected under the other call, which then
+  // crashes inside Wine's SetSecurityInfo.
+  std::mutex dacl_mutex_;
 };
 
 }  // namespace parlo::ipc::impl
