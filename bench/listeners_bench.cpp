@@ -150,8 +150,8 @@ std::vector<double> win32_handoff_us(int count) {
 }  // namespace
 
 int run_propagation() {
-  constexpr int blocks = 5;
-  constexpr int per_block = 200;
+  constexpr int blocks = 20;
+  constexpr int per_block = 50;
   peer_process peer;
   raw_pipe_server raw;
   bus_side side;

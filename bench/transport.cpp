@@ -17,8 +17,8 @@
 namespace bench {
 namespace {
 
-constexpr int blocks = 5;
-constexpr int per_block = 200;
+constexpr int blocks = 20;
+constexpr int per_block = 50;
 constexpr int warm_up = 20;
 
 // A's end of the bus echo: the delivery thread stamps each echo (id 2) and
