@@ -66,7 +66,7 @@ peer_process::~peer_process() {
   if (reader_.joinable()) reader_.join();
 }
 
-bool peer_process::start() {
+bool peer_process::start(const std::wstring& image) {
   SECURITY_ATTRIBUTES inherit{sizeof(inherit), nullptr, TRUE};
   HANDLE child_in = nullptr;
   HANDLE our_in = nullptr;
@@ -95,7 +95,6 @@ bool peer_process::start() {
   startup.hStdInput = child_in;
   startup.hStdOutput = child_out;
   startup.hStdError = ::GetStdHandle(STD_ERROR_HANDLE);
-  const std::wstring image = own_image();
   std::wstring command = L"\"" + image + L"\" peer";
   PROCESS_INFORMATION info{};
   if (!::CreateProcessW(image.c_str(), &command[0], /* process_attributes */ nullptr,

@@ -50,9 +50,10 @@ class peer_process {
   // Asks the peer to quit, and ends it when it does not within 5 s.
   ~peer_process();
 
-  // False (with a line on standard error) when the process cannot start or
-  // does not say "ready" within 20 s.
-  bool start();
+  // Starts `image` (this program unless given) as `IMAGE peer`. False (with
+  // a line on standard error) when the process cannot start or does not say
+  // "ready" within 20 s.
+  bool start(const std::wstring& image = own_image());
   DWORD pid() const { return pid_; }
 
   void send(const std::string& command);

@@ -7,6 +7,7 @@
 
 #include <atomic>
 #include <chrono>
+#include <cstdio>
 #include <future>
 #include <string>
 #include <thread>
@@ -141,6 +142,76 @@ TEST(bench_bus_side, a_post_on_the_serving_bus_reaches_the_joined_bus_with_its_s
   EXPECT_EQ(0u, bench::payload_sequence(shortened));
   shortened->release();
   EXPECT_EQ(8u, bench::make_payload(3, 9).size());
+}
+
+// vorbel_bench.exe in bin/, three folders up from this test's own folder.
+std::wstring bench_image() {
+  std::wstring path = bench::own_image();
+  path.resize(path.find_last_of(L'\\') + 1);
+  return path + L"..\\..\\..\\bin\\vorbel_bench.exe";
+}
+
+struct service_line {
+  unsigned long long publications = ~0ull;
+  unsigned long long bytes = ~0ull;
+  unsigned long long empty = ~0ull;
+  unsigned long long removed = ~0ull;
+};
+service_line service(bench::peer_process& peer) {
+  service_line s;
+  const std::string line = peer.request("service", "service");
+  std::sscanf(line.c_str(), "service pubs=%llu bytes=%llu empty=%llu removed=%llu", &s.publications, &s.bytes,
+              &s.empty, &s.removed);
+  return s;
+}
+
+TEST(bench_peer, the_peer_counts_what_the_convergence_table_is_made_of) {
+  bench::peer_process peer;
+  ASSERT_TRUE(peer.start(bench_image()));
+
+  bench::raw_pipe_server raw;
+  const std::string raw_pipe = bench::pipe_name("test_peer_raw");
+  ASSERT_TRUE(raw.create(raw_pipe));
+  ASSERT_FALSE(peer.request("raw " + raw_pipe + " echo", "ok raw").empty());
+  ASSERT_TRUE(raw.accept());
+  EXPECT_TRUE(raw.round_trip(std::string(64, 'r')));
+
+  const std::string pipe = bench::pipe_name("test_peer_bus");
+  bench::bus_side side;
+  ASSERT_TRUE(side.serve(pipe));
+  ASSERT_FALSE(peer.request("bus " + pipe, "ok bus").empty());
+  // The handshake: this process's empty table, on connect and on request.
+  ASSERT_TRUE(test_support::wait_until([&] { return service(peer).empty >= 2; }, 20s));
+
+  peer.send("watch print");
+  const listener_list table = bench::make_listener_table(3);
+  const std::int64_t start = bench::now_ticks();
+  std::size_t exact = 0;
+  listener_list growing;
+  for (const listener& item : table) {
+    ASSERT_EQ(0u, side.bus()->register_listener(item.channel.c_str(), item.id.c_str()));
+    growing.push_back(item);
+    exact += comm::encode_listeners(::GetCurrentProcessId(), growing).size();
+  }
+  for (const listener& item : table) {
+    const std::string line = peer.take_line("+ " + item.id + " ", 10s);
+    ASSERT_FALSE(line.empty()) << item.id;
+    EXPECT_GT(std::stoll(line.substr(line.find_last_of(' ') + 1)), start) << "one clock for both processes";
+  }
+  peer.send("watch count 3");
+  EXPECT_FALSE(peer.take_line("all 3 ", 10s).empty()) << "B already holds all three";
+
+  service_line counted = service(peer);
+  EXPECT_EQ(3u, counted.publications) << "one whole-table publication per registration";
+  EXPECT_EQ(exact, counted.bytes);
+  EXPECT_EQ(0u, counted.removed);
+
+  peer.send("watch print");
+  ASSERT_EQ(0u, side.bus()->unregister_listener(bench::bench_channel, table.front().id.c_str()));
+  EXPECT_FALSE(peer.take_line("- " + table.front().id + " ", 10s).empty());
+  counted = service(peer);
+  EXPECT_EQ(4u, counted.publications);
+  EXPECT_EQ(1u, counted.removed);
 }
 
 }  // namespace
