@@ -155,7 +155,13 @@ std::uint32_t bus::on_listeners_requested() {
 
 void bus::on_remote_listeners(const std::uint32_t& pid, listener_list received) {
   if (pid == pid_) return;
-  std::lock_guard<std::mutex> lock(mutex_);
+  std::unique_lock<std::mutex> lock(mutex_);
+  if (departed_.count(pid) != 0) {
+    lock.unlock();  // no lock is held while a line is written
+    logger_stream(logging::level_info, L"bus::on_remote_listeners")
+        << L"listeners of pid=" << pid << L" dropped: the process has disconnected";
+    return;
+  }
   auto entry = listeners_.find(pid);
   if (entry == listeners_.end() || entry->second.empty()) {
     post_new_listeners(notifier_, observer_list_, pid, received);
@@ -171,9 +177,28 @@ void bus::on_remote_listeners(const std::uint32_t& pid, listener_list received) 
   entry->second = std::move(received);
 }
 
+void bus::mark_departed_locked(std::uint32_t pid) {
+  // A list in flight arrives within moments of its sender's end; the most
+  // recent departures are enough to catch it, and the set stays bounded.
+  constexpr std::size_t max_departed = 1024;
+  if (!departed_.insert(pid).second) return;
+  departed_order_.push_back(pid);
+  while (departed_order_.size() > max_departed) {
+    departed_.erase(departed_order_.front());
+    departed_order_.pop_front();
+  }
+}
+
 void bus::drop_process(std::uint32_t pid) {
   if (pid == pid_) return;
   std::lock_guard<std::mutex> lock(mutex_);
+  // A disconnect whose connect came before this bus observed the gateway
+  // finds no count: that was the process's last known connection too.
+  auto count = connections_.find(pid);
+  if (count == connections_.end() || --count->second == 0) {
+    if (count != connections_.end()) connections_.erase(count);
+    mark_departed_locked(pid);
+  }
   auto entry = listeners_.find(pid);
   if (entry == listeners_.end()) return;
   listener_list gone = std::move(entry->second);
@@ -181,21 +206,28 @@ void bus::drop_process(std::uint32_t pid) {
   post_listeners_removed(notifier_, observer_list_, pid, std::move(gone));
 }
 
-void bus::on_connect() {
-  if (!service_channel_) return;
+void bus::on_connect(std::uint32_t pid) {
   {
     std::lock_guard<std::mutex> lock(mutex_);
+    if (pid != pid_) {
+      ++connections_[pid];
+      if (departed_.erase(pid) != 0) {
+        departed_order_.erase(std::find(departed_order_.begin(), departed_order_.end(), pid));
+      }
+    }
+    if (!service_channel_) return;
     publish_locked();
   }
+  // Asked once the process counts as connected, so its answer is taken.
   service_channel_->request_remote_listeners();
 }
 
 void bus::on_listen(const char*) {}
-void bus::on_local_connect(const char*, std::uint32_t) { on_connect(); }
+void bus::on_local_connect(const char*, std::uint32_t pid) { on_connect(pid); }
 void bus::on_local_disconnect(const char*, std::uint32_t pid) { drop_process(pid); }
 void bus::on_local_start_communication(const char*, std::uint32_t) {}
 void bus::on_local_error(const char*, std::uint32_t, std::uint32_t) {}
-void bus::on_remote_connect(const char*, std::uint32_t) { on_connect(); }
+void bus::on_remote_connect(const char*, std::uint32_t pid) { on_connect(pid); }
 void bus::on_remote_disconnect(const char*, std::uint32_t pid) { drop_process(pid); }
 void bus::on_remote_start_communication(const char*, std::uint32_t) {}
 void bus::on_remote_error(const char*, std::uint32_t, std::uint32_t) {}

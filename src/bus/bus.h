@@ -5,8 +5,9 @@
 // connected process. Created and destroyed by the registry under its mutex.
 // Host threads call the ibus operations; the messaging library's delivery
 // threads call the service-channel face; the gateway's notification thread
-// calls the igateway_observer face. `mutex_` guards the table and every
-// publication of this process's listeners; notifications never run under it:
+// calls the igateway_observer face. `mutex_` guards the table, the record of
+// connected and departed processes and every publication of this process's
+// listeners; notifications never run under it:
 // they are posted to `notifier_` and run there one at a time.
 #pragma once
 
@@ -14,9 +15,11 @@
 #include <vorbel/igateway.h>
 
 #include <cstdint>
+#include <deque>
 #include <map>
 #include <memory>
 #include <mutex>
+#include <set>
 #include <string>
 
 #include "bus/comm/service_channel.h"
@@ -87,8 +90,10 @@ class bus final : public qm::observable<ibus_observer_base*, ibus>,
   };
 
   std::uint32_t publish_locked();
-  void on_connect();
+  void on_connect(std::uint32_t pid);
   void drop_process(std::uint32_t pid);
+  // Notes that process `pid` has no connection left that this bus heard of.
+  void mark_departed_locked(std::uint32_t pid);
 
   // Declaration order is teardown order in reverse: the library outlives the
   // messaging bus, which outlives the notifier and the table.
@@ -99,5 +104,13 @@ class bus final : public qm::observable<ibus_observer_base*, ibus>,
   bus_observer_list* observer_list_;
   task_pool<0> notifier_;
   std::map<std::uint32_t, listener_list> listeners_;
+  // Connections per remote process, as the gateway's events told them.
+  std::map<std::uint32_t, std::uint32_t> connections_;
+  // Processes whose last connection ended, most recent last: a list of
+  // theirs still on its way (it travels on the messaging library's delivery
+  // thread, the disconnect on the gateway's) must not bring their listeners
+  // back. A process leaves the set when it connects again.
+  std::set<std::uint32_t> departed_;
+  std::deque<std::uint32_t> departed_order_;
   std::mutex mutex_;
 };

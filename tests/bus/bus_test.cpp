@@ -268,6 +268,35 @@ TEST_F(bus_test, connect_publishes_then_asks_and_disconnect_drops_the_process) {
   EXPECT_TRUE(taken().empty()) << "an unknown process has nothing to drop";
 }
 
+TEST_F(bus_test, a_list_arriving_after_its_process_left_is_dropped_until_it_connects_again) {
+  // Two connections of one process: the first to end drops its listeners as
+  // ever, and its lists count while the other lives.
+  b->on_local_connect("\\pipe", other_pid);
+  b->on_remote_connect("\\other", other_pid);
+  publish_as(other_pid, {{"a", "1"}});
+  settle();
+  taken();
+  b->on_local_disconnect("\\pipe", other_pid);
+  publish_as(other_pid, {{"a", "2"}});
+  settle();
+  EXPECT_EQ((notifications{removed(other_pid, "a", "1"), added(other_pid, "a", "2")}), taken());
+
+  // Its last connection ends: a list still on its way cannot bring it back.
+  b->on_remote_disconnect("\\other", other_pid);
+  publish_as(other_pid, {{"a", "3"}});
+  settle();
+  EXPECT_EQ((notifications{removed(other_pid, "a", "2")}), taken());
+  EXPECT_FALSE(b->is_registered_listener("a", "3"));
+  EXPECT_TRUE(has_line(L"bus::on_remote_listeners",
+                       L"listeners of pid=4242 dropped: the process has disconnected"));
+
+  // Connected again (a process that got the same id): its lists count.
+  b->on_local_connect("\\pipe", other_pid);
+  publish_as(other_pid, {{"a", "4"}});
+  settle();
+  EXPECT_EQ((notifications{added(other_pid, "a", "4")}), taken());
+}
+
 TEST_F(bus_test, notifications_run_on_the_notifier_thread_outside_the_bus_lock) {
   // An observer may call the bus from inside a notification: this would
   // deadlock if notifications ran under the bus's mutex or on the caller.
