@@ -20,7 +20,7 @@ namespace {
 thread_local bus_impl* t_delivering_bus = nullptr;
 
 struct bus_registry {
-  std::mutex mutex;
+  srw_mutex mutex;
   std::unordered_set<const parlo::bus*> live;
 };
 
@@ -128,7 +128,7 @@ bus_impl* bus_impl::create(const char* name) {
   }
   try {
     bus_registry& r = buses();
-    std::lock_guard<std::mutex> lock(r.mutex);
+    std::lock_guard<srw_mutex> lock(r.mutex);
     r.live.insert(bus);
   } catch (const std::bad_alloc&) {
     log_line(level_error, "parlo::create_bus") << "out of memory";
@@ -140,14 +140,14 @@ bus_impl* bus_impl::create(const char* name) {
 
 bus_impl* bus_impl::find_live(parlo::bus* candidate) {
   bus_registry& r = buses();
-  std::lock_guard<std::mutex> lock(r.mutex);
+  std::lock_guard<srw_mutex> lock(r.mutex);
   return r.live.count(candidate) != 0 ? static_cast<bus_impl*>(candidate) : nullptr;
 }
 
 bool bus_impl::destroy(parlo::bus* candidate) {
   {
     bus_registry& r = buses();
-    std::lock_guard<std::mutex> lock(r.mutex);
+    std::lock_guard<srw_mutex> lock(r.mutex);
     if (r.live.erase(candidate) == 0) return false;
   }
   static_cast<bus_impl*>(candidate)->shut_down();
@@ -159,7 +159,7 @@ void bus_impl::shut_down() {
   // the bus when the callback that called us returns.
   const bool from_callback = on_delivery_thread();
   {
-    std::lock_guard<std::mutex> lock(mutex_);
+    std::lock_guard<srw_mutex> lock(mutex_);
     closing_ = true;
     stop_ = true;
     teardown_on_thread_ = from_callback;
@@ -196,7 +196,7 @@ std::uint32_t bus_impl::create_channel(const char* name) {
   const char* const function = "parlo::bus::create_channel";
   if (!valid_name(name, function, "name")) return error_invalid_parameter;
   try {
-    std::lock_guard<std::mutex> lock(mutex_);
+    std::lock_guard<srw_mutex> lock(mutex_);
     if (!closing_) {
       if (find_channel_locked(name) == nullptr)
         channels_.emplace(name, std::make_unique<channel_impl>(*this, name));
@@ -215,7 +215,7 @@ std::uint32_t bus_impl::flush(std::uint32_t timeout_ms) {
     log_line(level_error, "parlo::bus::flush") << "called on the delivery thread";
     return error_possible_deadlock;
   }
-  std::unique_lock<std::mutex> lock(mutex_);
+  std::unique_lock<srw_mutex> lock(mutex_);
   const std::uint64_t target = posted_seq_;
   const auto done = [&] { return delivered_seq_ >= target || stop_; };
   ++progress_waiters_;
@@ -235,12 +235,12 @@ parlo::channel* bus_impl::get_channel(const char* name) {
     log_line(level_error, "parlo::bus::get_channel") << "name is nullptr";
     return nullptr;
   }
-  std::lock_guard<std::mutex> lock(mutex_);
+  std::lock_guard<srw_mutex> lock(mutex_);
   return find_channel_locked(name);
 }
 
 std::uint32_t bus_impl::channel_count() {
-  std::lock_guard<std::mutex> lock(mutex_);
+  std::lock_guard<srw_mutex> lock(mutex_);
   return static_cast<std::uint32_t>(channels_.size());
 }
 
@@ -274,7 +274,7 @@ std::uint32_t bus_impl::enqueue(channel_impl& channel, message_impl* copy, bool 
                                 const char* function) {
   std::uint32_t result = success;
   {
-    std::lock_guard<std::mutex> lock(mutex_);
+    std::lock_guard<srw_mutex> lock(mutex_);
     if (closing_) {
       result = error_invalid_state;
     } else if (queue_.size() >= max_queued_messages) {
@@ -304,7 +304,7 @@ parlo::subscription* bus_impl::create_subscription(channel_impl& channel) {
   const char* const function = "parlo::channel::create_subscription";
   try {
     auto created = std::make_unique<subscription_impl>(channel);
-    std::lock_guard<std::mutex> lock(mutex_);
+    std::lock_guard<srw_mutex> lock(mutex_);
     if (!closing_) {
       channel.subscriptions_.push_back(created.get());
       return created.release();
@@ -324,7 +324,7 @@ std::uint32_t bus_impl::destroy_subscription(channel_impl& channel,
     log_line(level_error, function) << "subscription is nullptr";
     return error_invalid_parameter;
   }
-  std::unique_lock<std::mutex> lock(mutex_);
+  std::unique_lock<srw_mutex> lock(mutex_);
   auto& list = channel.subscriptions_;
   // Compared as pointers only: a stray pointer is never dereferenced.
   const auto it = std::find_if(list.begin(), list.end(), [&](const subscription_impl* entry) {
@@ -354,7 +354,7 @@ std::uint32_t bus_impl::destroy_subscription(channel_impl& channel,
 }
 
 std::uint32_t bus_impl::subscription_count(channel_impl& channel) {
-  std::lock_guard<std::mutex> lock(mutex_);
+  std::lock_guard<srw_mutex> lock(mutex_);
   return static_cast<std::uint32_t>(count_present(channel.subscriptions_));
 }
 
@@ -367,7 +367,7 @@ std::uint32_t bus_impl::listen(subscription_impl& subscription, message_callback
     return error_invalid_parameter;
   }
   {
-    std::lock_guard<std::mutex> lock(mutex_);
+    std::lock_guard<srw_mutex> lock(mutex_);
     if (!subscription.listening_ && !closing_) {
       subscription.callback_ = callback;
       subscription.context_ = context;
@@ -381,7 +381,7 @@ std::uint32_t bus_impl::listen(subscription_impl& subscription, message_callback
 }
 
 bool bus_impl::is_listening(subscription_impl& subscription) {
-  std::lock_guard<std::mutex> lock(mutex_);
+  std::lock_guard<srw_mutex> lock(mutex_);
   return subscription.listening_;
 }
 
@@ -397,7 +397,7 @@ std::uint32_t bus_impl::tap(const char* channel, ext::tap_callback callback, voi
   }
   if (!valid_name(channel, function, "channel")) return error_invalid_parameter;
   try {
-    std::lock_guard<std::mutex> lock(mutex_);
+    std::lock_guard<srw_mutex> lock(mutex_);
     if (!closing_) {
       channel_impl* target = find_channel_locked(channel);
       if (target == nullptr) {
@@ -427,7 +427,7 @@ std::uint32_t bus_impl::tap(const char* channel, ext::tap_callback callback, voi
 }
 
 std::uint32_t bus_impl::untap(std::uint64_t tap_id) {
-  std::unique_lock<std::mutex> lock(mutex_);
+  std::unique_lock<srw_mutex> lock(mutex_);
   const auto where = tap_channels_.find(tap_id);
   if (where == tap_channels_.end()) {
     lock.unlock();
@@ -470,7 +470,7 @@ std::uint32_t bus_impl::inject(const char* channel, const void* bytes, std::uint
   if (!valid_name(channel, function, "channel")) return error_invalid_parameter;
   channel_impl* target = nullptr;
   {
-    std::lock_guard<std::mutex> lock(mutex_);
+    std::lock_guard<srw_mutex> lock(mutex_);
     target = find_channel_locked(channel);
   }
   if (target == nullptr) {
@@ -496,7 +496,7 @@ std::uint32_t bus_impl::inject(const char* channel, const void* bytes, std::uint
 
 // --- delivery thread -----------------------------------------------------------
 
-void bus_impl::wait_not_running_locked(std::unique_lock<std::mutex>& lock, const void* callee) {
+void bus_impl::wait_not_running_locked(std::unique_lock<srw_mutex>& lock, const void* callee) {
   ++progress_waiters_;
   progress_cv_.wait(lock, [&] { return running_ != callee; });
   --progress_waiters_;
@@ -508,7 +508,7 @@ void bus_impl::notify_progress_locked() {
 
 void bus_impl::run() {
   t_delivering_bus = this;
-  std::unique_lock<std::mutex> lock(mutex_);
+  std::unique_lock<srw_mutex> lock(mutex_);
   for (;;) {
     work_cv_.wait(lock, [this] { return stop_ || !queue_.empty(); });
     if (stop_) break;
@@ -532,7 +532,7 @@ void bus_impl::run() {
   }
 }
 
-void bus_impl::deliver_locked(std::unique_lock<std::mutex>& lock, const queued_message& item) {
+void bus_impl::deliver_locked(std::unique_lock<srw_mutex>& lock, const queued_message& item) {
   walking_ = item.channel;
   if (!item.injected && !item.channel->taps_.empty()) run_taps_locked(lock, item);
   run_subscriptions_locked(lock, item);
@@ -541,7 +541,7 @@ void bus_impl::deliver_locked(std::unique_lock<std::mutex>& lock, const queued_m
   compact(item.channel->subscriptions_);
 }
 
-void bus_impl::run_taps_locked(std::unique_lock<std::mutex>& lock, const queued_message& item) {
+void bus_impl::run_taps_locked(std::unique_lock<srw_mutex>& lock, const queued_message& item) {
   channel_impl& channel = *item.channel;
   lock.unlock();
   std::vector<unsigned char> bytes;
@@ -577,7 +577,7 @@ void bus_impl::run_taps_locked(std::unique_lock<std::mutex>& lock, const queued_
   }
 }
 
-void bus_impl::run_subscriptions_locked(std::unique_lock<std::mutex>& lock,
+void bus_impl::run_subscriptions_locked(std::unique_lock<srw_mutex>& lock,
                                         const queued_message& item) {
   channel_impl& channel = *item.channel;
   for (std::size_t i = 0; i < channel.subscriptions_.size() && !closing_; ++i) {

@@ -13,13 +13,14 @@
 #pragma once
 
 #include <atomic>
-#include <condition_variable>
 #include <cstdint>
 #include <deque>
 #include <functional>
 #include <map>
 #include <memory>
 #include <mutex>
+
+#include "platform/srw_sync.h"
 #include <string>
 #include <string_view>
 #include <thread>
@@ -156,22 +157,22 @@ class bus_impl final : public parlo::bus {
 
   channel_impl* find_channel_locked(std::string_view name);
   // Waits until `callee` is no longer running its callback.
-  void wait_not_running_locked(std::unique_lock<std::mutex>& lock, const void* callee);
+  void wait_not_running_locked(std::unique_lock<srw_mutex>& lock, const void* callee);
   void notify_progress_locked();
 
   // The delivery thread.
   void run();
-  void deliver_locked(std::unique_lock<std::mutex>& lock, const queued_message& item);
-  void run_taps_locked(std::unique_lock<std::mutex>& lock, const queued_message& item);
-  void run_subscriptions_locked(std::unique_lock<std::mutex>& lock, const queued_message& item);
+  void deliver_locked(std::unique_lock<srw_mutex>& lock, const queued_message& item);
+  void run_taps_locked(std::unique_lock<srw_mutex>& lock, const queued_message& item);
+  void run_subscriptions_locked(std::unique_lock<srw_mutex>& lock, const queued_message& item);
 
   const std::string name_;
   winapi::unique_module module_;  // released after thread_ has ended
   std::thread thread_;
 
-  std::mutex mutex_;
-  std::condition_variable work_cv_;      // the delivery thread waits for work
-  std::condition_variable progress_cv_;  // flush and removals wait for the delivery thread
+  srw_mutex mutex_;
+  srw_condition_variable work_cv_;      // the delivery thread waits for work
+  srw_condition_variable progress_cv_;  // flush and removals wait for the delivery thread
   unsigned progress_waiters_ = 0;
   std::map<std::string, std::unique_ptr<channel_impl>, std::less<>> channels_;
   std::unordered_map<std::uint64_t, channel_impl*> tap_channels_;

@@ -1,5 +1,7 @@
 #include "message_impl.h"
 
+#include "platform/srw_sync.h"
+
 #include <cstring>
 #include <mutex>
 #include <new>
@@ -18,7 +20,7 @@ static_assert(codec::max_content_size == parlo::max_message_size,
 
 // Live messages by address.
 struct registry {
-  std::mutex mutex;
+  srw_mutex mutex;
   std::unordered_set<const parlo::message*> live;
 };
 
@@ -37,7 +39,7 @@ message_impl* message_impl::create(codec::message_content content, bool library_
   auto* created = new message_impl(std::move(content), library_owned);
   try {
     registry& r = messages();
-    std::lock_guard<std::mutex> lock(r.mutex);
+    std::lock_guard<srw_mutex> lock(r.mutex);
     r.live.insert(created);
   } catch (...) {
     delete created;
@@ -48,7 +50,7 @@ message_impl* message_impl::create(codec::message_content content, bool library_
 
 message_impl* message_impl::find_live(parlo::message* candidate) {
   registry& r = messages();
-  std::lock_guard<std::mutex> lock(r.mutex);
+  std::lock_guard<srw_mutex> lock(r.mutex);
   return r.live.count(candidate) != 0 ? static_cast<message_impl*>(candidate) : nullptr;
 }
 
@@ -56,7 +58,7 @@ void message_impl::destroy(message_impl* message) noexcept {
   if (message == nullptr) return;
   {
     registry& r = messages();
-    std::lock_guard<std::mutex> lock(r.mutex);
+    std::lock_guard<srw_mutex> lock(r.mutex);
     r.live.erase(message);
   }
   delete message;

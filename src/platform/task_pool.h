@@ -5,11 +5,8 @@
 // lock. Destruction lets the running task finish and drops the queued ones
 // unrun, so a task must not rely on a later one to clean up after it.
 //
-// The queue is guarded by a slim reader/writer lock and the worker sleeps on
-// a system condition variable: with the mingw-w64 runtime the standard mutex
-// and condition variable go through kernel semaphores, and each hand-off to
-// the worker cost about 15 times as much (measured under Wine: 144 against
-// 10 microseconds), on the path of every listener notification.
+// The queue's lock and the worker's wake-up are the system's slim ones
+// (platform/srw_sync.h): every listener notification is handed over here.
 #pragma once
 
 #include <windows.h>
@@ -24,6 +21,7 @@
 #include <utility>
 
 #include "logging/logger.h"
+#include "platform/srw_sync.h"
 
 // N picks the flavour of pool; 0, the only one defined, has a single worker.
 template <int N>
@@ -35,7 +33,7 @@ class task_pool {
     running_ = true;
     // Held while the worker starts, so that the worker sees worker_ assigned
     // before it can run a task that asks on_worker_thread().
-    exclusive lock(lock_);
+    std::lock_guard<srw_mutex> lock(lock_);
     worker_ = std::thread(&task_pool::worker, this);
   }
   task_pool(const task_pool&) = delete;
@@ -48,17 +46,17 @@ class task_pool {
       std::abort();
     }
     {
-      exclusive lock(lock_);
+      std::lock_guard<srw_mutex> lock(lock_);
       running_ = false;
-      ::WakeAllConditionVariable(&wake_);
+      wake_.notify_all();
     }
     worker_.join();
   }
 
   void post(std::function<void()> task) {
-    exclusive lock(lock_);
+    std::lock_guard<srw_mutex> lock(lock_);
     queue_.push_back(std::move(task));
-    ::WakeConditionVariable(&wake_);
+    wake_.notify_one();
   }
 
   // True on the worker thread; pool-only code asserts it.
@@ -69,22 +67,10 @@ class task_pool {
   bool stopping() const { return !running_; }
 
  private:
-  // Holds `lock_` exclusively for a scope.
-  class exclusive {
-   public:
-    explicit exclusive(SRWLOCK& lock) : lock_(lock) { ::AcquireSRWLockExclusive(&lock_); }
-    exclusive(const exclusive&) = delete;
-    exclusive& operator=(const exclusive&) = delete;
-    ~exclusive() { ::ReleaseSRWLockExclusive(&lock_); }
-
-   private:
-    SRWLOCK& lock_;
-  };
-
   // An empty task when the pool stops, even if tasks remain.
   std::function<void()> next_task() {
-    exclusive lock(lock_);
-    while (running_ && queue_.empty()) ::SleepConditionVariableSRW(&wake_, &lock_, INFINITE, 0);
+    std::unique_lock<srw_mutex> lock(lock_);
+    wake_.wait(lock, [this] { return !running_ || !queue_.empty(); });
     if (!running_) return {};
     std::function<void()> task = std::move(queue_.front());
     queue_.pop_front();
@@ -110,8 +96,8 @@ class task_pool {
   }
 
   std::deque<std::function<void()>> queue_;
-  SRWLOCK lock_ = SRWLOCK_INIT;
+  srw_mutex lock_;
   std::thread worker_;
   std::atomic<bool> running_{false};
-  CONDITION_VARIABLE wake_ = CONDITION_VARIABLE_INIT;
+  srw_condition_variable wake_;
 };
