@@ -55,7 +55,7 @@ void connection::enqueue(const frame_ptr& frame) {
   if (!frame) return;
   bool dropped = false;
   {
-    std::lock_guard<std::mutex> lock(mutex_);
+    std::lock_guard<srw_mutex> lock(mutex_);
     if (queue_closed_ || overflow_) return;
     if (queued_bytes_ + frame->size() > max_queued_bytes) {
       overflow_ = true;
@@ -75,7 +75,7 @@ void connection::enqueue(const frame_ptr& frame) {
 }
 
 void connection::close_queue() {
-  std::lock_guard<std::mutex> lock(mutex_);
+  std::lock_guard<srw_mutex> lock(mutex_);
   queue_closed_ = true;
   queue_.clear();
   queued_bytes_ = 0;
@@ -180,7 +180,7 @@ void connection::run() {
       bool overflow = false;
       bool fresh = false;  // a new write to issue
       {
-        std::lock_guard<std::mutex> lock(mutex_);
+        std::lock_guard<srw_mutex> lock(mutex_);
         // Checked every round: a peer that does not read never completes
         // the write in flight.
         overflow = overflow_;
@@ -242,7 +242,7 @@ void connection::run() {
           }
         } else {
           writing.pending = false;
-          std::lock_guard<std::mutex> lock(mutex_);
+          std::lock_guard<srw_mutex> lock(mutex_);
           queued_bytes_ -= std::min<std::uint64_t>(queued_bytes_, writing.total);
           writing.large.reset();
         }

@@ -14,6 +14,7 @@
 
 #include "frame_codec.h"
 #include "platform/handles.h"
+#include "platform/srw_sync.h"
 
 namespace parlo::ipc::impl {
 
@@ -95,7 +96,7 @@ class connection {
   winapi::unique_handle pipe_;
   winapi::unique_handle wake_event_;  // auto-reset: a frame was queued
 
-  std::mutex mutex_;  // guards the queue
+  srw_mutex mutex_;  // guards the queue
   std::deque<frame_ptr> queue_;
   std::uint64_t queued_bytes_ = 0;  // queued plus in flight
   bool queue_closed_ = false;

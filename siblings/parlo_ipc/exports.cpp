@@ -14,6 +14,7 @@
 #include "gateway_impl.h"
 #include "logging/log_dll.h"
 #include "logging/logger.h"
+#include "platform/srw_sync.h"
 
 using parlo::ipc::impl::gateway_impl;
 
@@ -22,7 +23,7 @@ namespace {
 // The gateways create_gateway made and destroy_gateway has not freed; an
 // unknown pointer handed to destroy_gateway is refused, not deleted.
 struct live_gateways {
-  std::mutex mutex;
+  srw_mutex mutex;
   std::vector<parlo::ipc::gateway*> list;
 };
 
@@ -49,7 +50,7 @@ parlo::ipc::gateway* create_gateway(parlo::bus* bus, parlo::ipc::gateway::events
   if (err == 0) {
     try {
       live_gateways& gateways = live();
-      std::lock_guard<std::mutex> lock(gateways.mutex);
+      std::lock_guard<srw_mutex> lock(gateways.mutex);
       gateways.list.push_back(created);
     } catch (const std::bad_alloc&) {
       err = ERROR_NOT_ENOUGH_MEMORY;
@@ -79,7 +80,7 @@ void destroy_gateway(parlo::ipc::gateway* gateway) {
   gateway_impl* found = nullptr;
   {
     live_gateways& gateways = live();
-    std::lock_guard<std::mutex> lock(gateways.mutex);
+    std::lock_guard<srw_mutex> lock(gateways.mutex);
     const auto it = std::find(gateways.list.begin(), gateways.list.end(), gateway);
     if (it != gateways.list.end()) {
       found = static_cast<gateway_impl*>(*it);

@@ -95,7 +95,7 @@ bool gateway_impl::on_own_thread() const { return t_owner == this; }
 gateway_impl::gateway_impl(parlo::bus* bus, gateway::events* sink) : bus_(bus), sink_(sink) {}
 
 gateway_impl::~gateway_impl() {
-  std::lock_guard<std::mutex> lock(control_mutex_);
+  std::lock_guard<srw_mutex> lock(control_mutex_);
   if (running_) {
     stop_locked();
     running_ = false;
@@ -148,7 +148,7 @@ std::uint32_t gateway_impl::export_channel(const char* channel, const char* pipe
     logging::logger_stream(logging::level_error, function) << L"called from one of its events";
     return ERROR_POSSIBLE_DEADLOCK;
   }
-  std::lock_guard<std::mutex> lock(control_mutex_);
+  std::lock_guard<srw_mutex> lock(control_mutex_);
   if (running_) {
     logging::logger_stream(logging::level_error, function)
         << L"channel=" << channel << L" pipe=" << pipe << L": the gateway runs; stop it first";
@@ -197,7 +197,7 @@ std::uint32_t gateway_impl::import_channel(const char* channel, const char* pipe
     logging::logger_stream(logging::level_error, function) << L"called from one of its events";
     return ERROR_POSSIBLE_DEADLOCK;
   }
-  std::lock_guard<std::mutex> lock(control_mutex_);
+  std::lock_guard<srw_mutex> lock(control_mutex_);
   if (running_) {
     logging::logger_stream(logging::level_error, function)
         << L"channel=" << channel << L" pipe=" << pipe << L": the gateway runs; stop it first";
@@ -246,7 +246,7 @@ std::uint32_t gateway_impl::start() {
     logging::logger_stream(logging::level_error, function) << L"called from one of its events";
     return ERROR_POSSIBLE_DEADLOCK;
   }
-  std::lock_guard<std::mutex> lock(control_mutex_);
+  std::lock_guard<srw_mutex> lock(control_mutex_);
   if (running_) {
     logging::logger_stream(logging::level_error, function) << L"already started";
     return ERROR_ALREADY_INITIALIZED;
@@ -334,7 +334,7 @@ std::uint32_t gateway_impl::stop() {
     logging::logger_stream(logging::level_error, function) << L"called from one of its events";
     return ERROR_POSSIBLE_DEADLOCK;
   }
-  std::lock_guard<std::mutex> lock(control_mutex_);
+  std::lock_guard<srw_mutex> lock(control_mutex_);
   if (!running_) {
     logging::logger_stream(logging::level_info, function) << L"not running";
     return 0;

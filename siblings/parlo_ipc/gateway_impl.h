@@ -20,6 +20,7 @@
 #include "pipe_config.h"
 #include "pipe_support.h"
 #include "platform/handles.h"
+#include "platform/srw_sync.h"
 
 namespace parlo::ipc::impl {
 
@@ -106,7 +107,7 @@ class gateway_impl final : public parlo::ipc::gateway {
   unique_local security_descriptor_;
   SECURITY_ATTRIBUTES security_attributes_{};
 
-  std::mutex control_mutex_;  // start, stop, export, import
+  srw_mutex control_mutex_;  // start, stop, export, import
   bool running_ = false;
   // Keyed by pipe_key(path).
   std::map<std::wstring, exported_pipe> exports_;

@@ -92,7 +92,7 @@ void pipe_client::join() {
 }
 
 void pipe_client::forward(const frame_ptr& frame) {
-  std::lock_guard<std::mutex> lock(mutex_);
+  std::lock_guard<srw_mutex> lock(mutex_);
   if (current_) current_->enqueue(frame);
 }
 
@@ -147,7 +147,7 @@ void pipe_client::run() {
     // Routed before the event: whatever is posted once on_remote_connect
     // has returned goes to this server.
     {
-      std::lock_guard<std::mutex> lock(mutex_);
+      std::lock_guard<srw_mutex> lock(mutex_);
       current_ = link;
     }
     const bool accepted = gateway_.raise_remote_connect(link->handle(), pid);
@@ -162,7 +162,7 @@ void pipe_client::run() {
           << L" the sink turned down server pid=" << pid;
     }
     {
-      std::lock_guard<std::mutex> lock(mutex_);
+      std::lock_guard<srw_mutex> lock(mutex_);
       current_.reset();
     }
     link->close_queue();

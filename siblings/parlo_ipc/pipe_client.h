@@ -12,6 +12,7 @@
 #include "connection.h"
 #include "pipe_config.h"
 #include "platform/handles.h"
+#include "platform/srw_sync.h"
 
 namespace parlo::ipc::impl {
 
@@ -60,7 +61,7 @@ class pipe_client {
   frame_ptr hello_;
   std::thread thread_;
 
-  std::mutex mutex_;  // guards current_
+  srw_mutex mutex_;  // guards current_
   std::shared_ptr<client_connection> current_;
 };
 

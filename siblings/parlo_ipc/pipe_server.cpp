@@ -24,7 +24,7 @@ server_connection::server_connection(gateway_impl& gateway, winapi::unique_handl
       server_(server) {}
 
 bool server_connection::wants(const std::string& channel) {
-  std::lock_guard<std::mutex> lock(filter_mutex_);
+  std::lock_guard<srw_mutex> lock(filter_mutex_);
   return !filtered_ || joined_.count(channel) != 0;
 }
 
@@ -48,7 +48,7 @@ std::uint32_t server_connection::on_hello(const frame::hello& hello) {
     }
     if ((found->second & link_send) != 0) joined.insert(channel);
   }
-  std::lock_guard<std::mutex> lock(filter_mutex_);
+  std::lock_guard<srw_mutex> lock(filter_mutex_);
   joined_ = std::move(joined);
   filtered_ = true;
   return 0;
@@ -120,14 +120,14 @@ void pipe_server::join() {
 }
 
 void pipe_server::forward(const std::string& channel, const frame_ptr& frame) {
-  std::lock_guard<std::mutex> lock(mutex_);
+  std::lock_guard<srw_mutex> lock(mutex_);
   for (const std::shared_ptr<server_connection>& link : routed_) {
     if (link->wants(channel)) link->enqueue(frame);
   }
 }
 
 void pipe_server::unroute(const std::shared_ptr<server_connection>& link) {
-  std::lock_guard<std::mutex> lock(mutex_);
+  std::lock_guard<srw_mutex> lock(mutex_);
   routed_.erase(std::remove(routed_.begin(), routed_.end(), link), routed_.end());
 }
 
@@ -165,7 +165,7 @@ void pipe_server::listen() {
       announced = false;
     }
     if (!announced) {
-      std::lock_guard<std::mutex> lock(dacl_mutex_);
+      std::lock_guard<srw_mutex> lock(dacl_mutex_);
       gateway_.raise_listen(instance.get(), config_.name.c_str());
       announced = true;
     }
@@ -245,7 +245,7 @@ void pipe_server::accept(winapi::unique_handle instance) {
     // wait until the client is admitted.
     link->enqueue(hello_);
     {
-      std::lock_guard<std::mutex> lock(mutex_);
+      std::lock_guard<srw_mutex> lock(mutex_);
       routed_.push_back(link);
     }
     routed = true;
@@ -278,7 +278,7 @@ void pipe_server::serve(worker& work) {
         << L"pipe=" << config_.name << L" handle=" << link.handle()
         << L" GetNamedPipeClientProcessId err=" << err;
   } else {
-    std::lock_guard<std::mutex> lock(dacl_mutex_);
+    std::lock_guard<srw_mutex> lock(dacl_mutex_);
     admitted = gateway_.raise_local_connect(link.handle(), pid);
   }
   if (!admitted) {

@@ -17,6 +17,7 @@
 #include "connection.h"
 #include "pipe_config.h"
 #include "platform/handles.h"
+#include "platform/srw_sync.h"
 
 namespace parlo::ipc::impl {
 
@@ -45,7 +46,7 @@ class server_connection final : public connection {
 
  private:
   pipe_server& server_;
-  std::mutex filter_mutex_;
+  srw_mutex filter_mutex_;
   bool filtered_ = false;
   std::set<std::string> joined_;
 };
@@ -100,7 +101,7 @@ class pipe_server {
   std::thread listener_;
   std::list<worker> workers_;  // listener thread only
 
-  std::mutex mutex_;  // guards routed_
+  srw_mutex mutex_;  // guards routed_
   std::vector<std::shared_ptr<server_connection>> routed_;
 
   // Held through each event that may set the pipe's DACL (on_listen,
@@ -109,7 +110,7 @@ class pipe_server {
   // the next instance while a client's admission sets one on its own would
   // leave the descriptor unprotected under the other call, which then
   // crashes inside Wine's SetSecurityInfo.
-  std::mutex dacl_mutex_;
+  srw_mutex dacl_mutex_;
 };
 
 }  // namespace parlo::ipc::impl

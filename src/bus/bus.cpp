@@ -92,7 +92,7 @@ std::uint32_t bus::register_listener(const char* channel, const char* id) {
     logger_stream(level_error, L"bus::register_listener") << L"id is nullptr";
     return ERROR_INVALID_PARAMETER;
   }
-  std::lock_guard<std::mutex> lock(mutex_);
+  std::lock_guard<srw_mutex> lock(mutex_);
   listener item{channel, id};
   insert_sorted(listeners_[pid_], item);
   post_new_listener(notifier_, observer_list_, pid_, item);
@@ -110,7 +110,7 @@ std::uint32_t bus::unregister_listener(const char* channel, const char* id) {
     logger_stream(level_error, L"bus::unregister_listener") << L"listener_id is nullptr";
     return ERROR_INVALID_PARAMETER;
   }
-  std::lock_guard<std::mutex> lock(mutex_);
+  std::lock_guard<srw_mutex> lock(mutex_);
   auto own = listeners_.find(pid_);
   if (own == listeners_.end()) return 0;
   const listener item{channel, id};
@@ -132,7 +132,7 @@ bool bus::is_registered_listener(const char* channel, const char* id) {
     return false;
   }
   const listener item{channel, id};
-  std::lock_guard<std::mutex> lock(mutex_);
+  std::lock_guard<srw_mutex> lock(mutex_);
   for (const auto& [pid, list] : listeners_) {
     if (std::find(list.begin(), list.end(), item) != list.end()) return true;
   }
@@ -149,13 +149,13 @@ std::uint32_t bus::publish_locked() {
 }
 
 std::uint32_t bus::on_listeners_requested() {
-  std::lock_guard<std::mutex> lock(mutex_);
+  std::lock_guard<srw_mutex> lock(mutex_);
   return publish_locked();
 }
 
 void bus::on_remote_listeners(const std::uint32_t& pid, listener_list received) {
   if (pid == pid_) return;
-  std::unique_lock<std::mutex> lock(mutex_);
+  std::unique_lock<srw_mutex> lock(mutex_);
   if (departed_.count(pid) != 0) {
     lock.unlock();  // no lock is held while a line is written
     logger_stream(logging::level_info, L"bus::on_remote_listeners")
@@ -191,7 +191,7 @@ void bus::mark_departed_locked(std::uint32_t pid) {
 
 void bus::drop_process(std::uint32_t pid) {
   if (pid == pid_) return;
-  std::lock_guard<std::mutex> lock(mutex_);
+  std::lock_guard<srw_mutex> lock(mutex_);
   // A disconnect whose connect came before this bus observed the gateway
   // finds no count: that was the process's last known connection too.
   auto count = connections_.find(pid);
@@ -208,7 +208,7 @@ void bus::drop_process(std::uint32_t pid) {
 
 void bus::on_connect(std::uint32_t pid) {
   {
-    std::lock_guard<std::mutex> lock(mutex_);
+    std::lock_guard<srw_mutex> lock(mutex_);
     if (pid != pid_) {
       ++connections_[pid];
       if (departed_.erase(pid) != 0) {

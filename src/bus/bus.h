@@ -27,6 +27,7 @@
 #include "bus/notifications.h"
 #include "platform/handles.h"
 #include "platform/observable.h"
+#include "platform/srw_sync.h"
 #include "platform/task_pool.h"
 
 namespace parlo {
@@ -112,5 +113,5 @@ class bus final : public qm::observable<ibus_observer_base*, ibus>,
   // back. A process leaves the set when it connects again.
   std::set<std::uint32_t> departed_;
   std::deque<std::uint32_t> departed_order_;
-  std::mutex mutex_;
+  srw_mutex mutex_;
 };

@@ -1,10 +1,10 @@
 #include "gateway/gateway_observer.h"
 
-#include <condition_variable>
 #include <mutex>
 #include <system_error>
 
 #include "logging/logger.h"
+#include "platform/srw_sync.h"
 #include "platform/win_api.h"
 #include "security/signature.h"
 
@@ -230,15 +230,15 @@ void gateway_observer::cache_process(const process_info& info, trust_level trust
 }
 
 void gateway_observer::run_on_worker(const std::function<void(connections_cache&)>& probe) {
-  std::mutex mutex;
-  std::condition_variable done_signal;
+  srw_mutex mutex;
+  srw_condition_variable done_signal;
   bool done = false;
   context_->pool.post([&] {
     probe(context_->connections);
-    std::lock_guard<std::mutex> lock(mutex);
+    std::lock_guard<srw_mutex> lock(mutex);
     done = true;
     done_signal.notify_one();
   });
-  std::unique_lock<std::mutex> lock(mutex);
+  std::unique_lock<srw_mutex> lock(mutex);
   done_signal.wait(lock, [&] { return done; });
 }

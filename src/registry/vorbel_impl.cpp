@@ -60,7 +60,7 @@ ibus* vorbel_impl::create_bus(const char* name, ibus_configuration* provider) {
   }
   logger_stream(level_info, L"vorbel_impl::create_bus") << L"bus name: " << name;
 
-  std::lock_guard<std::mutex> lock(mutex_);
+  std::lock_guard<srw_mutex> lock(mutex_);
   auto found = find_locked(name);
   if (found != buses_.end()) {
     ++found->second.ref_count;
@@ -97,7 +97,7 @@ void vorbel_impl::destroy_bus(const char* name) {
   }
   logger_stream(level_info, L"vorbel_impl::destroy_bus") << L"bus name: " << name;
 
-  std::lock_guard<std::mutex> lock(mutex_);
+  std::lock_guard<srw_mutex> lock(mutex_);
   auto found = find_locked(name);
   if (found == buses_.end()) {
     logger_stream(level_warning, L"vorbel_impl::destroy_bus") << L"bud not found";
@@ -114,13 +114,13 @@ void vorbel_impl::destroy_bus(const char* name) {
 }
 
 ibus* vorbel_impl::get_bus(const char* name) {
-  std::lock_guard<std::mutex> lock(mutex_);
+  std::lock_guard<srw_mutex> lock(mutex_);
   auto found = find_locked(name);
   return found == buses_.end() ? nullptr : found->second.bus->face();
 }
 
 igateway* vorbel_impl::get_gateway(const char* name) {
-  std::lock_guard<std::mutex> lock(mutex_);
+  std::lock_guard<srw_mutex> lock(mutex_);
   auto found = find_locked(name);
   if (found == buses_.end() || !found->second.gateway) return nullptr;
   return found->second.gateway->face();

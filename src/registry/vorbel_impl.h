@@ -15,6 +15,7 @@
 #include <string>
 #include <unordered_map>
 
+#include "platform/srw_sync.h"
 #include "registry/bus_builder.h"
 
 class vorbel_impl final : public ivorbel {
@@ -48,5 +49,5 @@ class vorbel_impl final : public ivorbel {
   std::unique_ptr<bus_builder> builder_;
   std::string default_bus_name_;
   bus_map buses_;
-  std::mutex mutex_;
+  srw_mutex mutex_;
 };

@@ -130,7 +130,7 @@ processes_trust_cache::~processes_trust_cache() {
 }
 
 trust_level processes_trust_cache::find(const process_info& info) {
-  std::lock_guard<std::mutex> lock(mutex_);
+  std::lock_guard<srw_mutex> lock(mutex_);
   if (high_.count(info) != 0) return trust_level::high_trust;
   if (low_.count(info) != 0) return trust_level::low_trust;
   if (untrusted_.count(info) != 0) return trust_level::untrusted;
@@ -158,7 +158,7 @@ void processes_trust_cache::add(const process_info& info, winapi::unique_handle 
         << L"null process handle for pid=" << info.pid;
     return;
   }
-  std::lock_guard<std::mutex> lock(mutex_);
+  std::lock_guard<srw_mutex> lock(mutex_);
   map_type* map = map_for_locked(trust);
   if (map == nullptr) return;  // `process` closes as it leaves
   trim_locked();
@@ -183,12 +183,12 @@ void processes_trust_cache::trim_locked() {
 }
 
 std::size_t processes_trust_cache::size() const {
-  std::lock_guard<std::mutex> lock(mutex_);
+  std::lock_guard<srw_mutex> lock(mutex_);
   return high_.size() + low_.size() + untrusted_.size();
 }
 
 std::size_t processes_trust_cache::count(trust_level trust) const {
-  std::lock_guard<std::mutex> lock(mutex_);
+  std::lock_guard<srw_mutex> lock(mutex_);
   switch (trust) {
     case trust_level::high_trust:
       return high_.size();
@@ -202,17 +202,17 @@ std::size_t processes_trust_cache::count(trust_level trust) const {
 }
 
 std::size_t processes_trust_cache::pending_close_count() const {
-  std::lock_guard<std::mutex> lock(mutex_);
+  std::lock_guard<srw_mutex> lock(mutex_);
   return evicted_.size();
 }
 
 bool processes_trust_cache::monitoring() const {
-  std::lock_guard<std::mutex> lock(mutex_);
+  std::lock_guard<srw_mutex> lock(mutex_);
   return monitoring_;
 }
 
 std::uint64_t processes_trust_cache::wait_rounds() const {
-  std::lock_guard<std::mutex> lock(mutex_);
+  std::lock_guard<srw_mutex> lock(mutex_);
   return wait_rounds_;
 }
 
@@ -224,7 +224,7 @@ void processes_trust_cache::monitor() {
     std::size_t low_begin = 0;
     std::size_t untrusted_begin = 0;
     {
-      std::lock_guard<std::mutex> lock(mutex_);
+      std::lock_guard<srw_mutex> lock(mutex_);
       handles.clear();
       handles.push_back(stop_event_.get());
       handles.push_back(wake_event_.get());
@@ -253,7 +253,7 @@ void processes_trust_cache::monitor() {
     const std::size_t index = result - WAIT_OBJECT_0;
     if (index >= handles.size()) continue;
     const HANDLE exited = handles[index];
-    std::lock_guard<std::mutex> lock(mutex_);
+    std::lock_guard<srw_mutex> lock(mutex_);
     map_type& map = index < low_begin ? high_ : (index < untrusted_begin ? low_ : untrusted_);
     for (auto it = map.begin(); it != map.end(); ++it) {
       if (it->second.get() == exited) {
@@ -264,7 +264,7 @@ void processes_trust_cache::monitor() {
   }
 
   // From here on nobody waits: evictions close at once.
-  std::lock_guard<std::mutex> lock(mutex_);
+  std::lock_guard<srw_mutex> lock(mutex_);
   monitoring_ = false;
   evicted_.clear();
 }

@@ -15,6 +15,7 @@
 #include <vector>
 
 #include "platform/handles.h"
+#include "platform/srw_sync.h"
 #include "security/signature.h"
 
 enum class trust_level : std::uint32_t { low_trust = 0, high_trust = 1, untrusted = 2, unknown = 3 };
@@ -108,7 +109,7 @@ class processes_trust_cache {
   map_type high_;
   map_type low_;
   map_type untrusted_;
-  mutable std::mutex mutex_;
+  mutable srw_mutex mutex_;
   std::thread thread_;
   winapi::unique_handle stop_event_;
   winapi::unique_handle wake_event_;

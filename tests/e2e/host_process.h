@@ -6,7 +6,6 @@
 #include <windows.h>
 
 #include <chrono>
-#include <condition_variable>
 #include <filesystem>
 #include <fstream>
 #include <functional>
@@ -14,6 +13,8 @@
 #include <string>
 #include <thread>
 #include <vector>
+
+#include "platform/srw_sync.h"
 
 namespace e2e {
 
@@ -108,7 +109,7 @@ class host_process {
   // Waits until a line (any seen so far, or a new one) satisfies `match`.
   bool wait_line(const std::function<bool(const std::string&)>& match,
                  std::chrono::milliseconds timeout = std::chrono::seconds(10)) {
-    std::unique_lock<std::mutex> lock(mutex_);
+    std::unique_lock<srw_mutex> lock(mutex_);
     return changed_.wait_for(lock, timeout, [&] {
       for (const auto& line : lines_) {
         if (match(line)) return true;
@@ -122,7 +123,7 @@ class host_process {
   // The time at which a line equal to `exact` was read, waiting for it.
   bool line_time(const std::string& exact, std::chrono::steady_clock::time_point& at,
                  std::chrono::milliseconds timeout) {
-    std::unique_lock<std::mutex> lock(mutex_);
+    std::unique_lock<srw_mutex> lock(mutex_);
     return changed_.wait_for(lock, timeout, [&] {
       for (std::size_t i = 0; i < lines_.size(); ++i) {
         if (lines_[i] == exact) {
@@ -134,14 +135,14 @@ class host_process {
     });
   }
   bool has_line(const std::string& exact) {
-    std::lock_guard<std::mutex> lock(mutex_);
+    std::lock_guard<srw_mutex> lock(mutex_);
     for (const auto& line : lines_) {
       if (line == exact) return true;
     }
     return false;
   }
   std::string output() {
-    std::lock_guard<std::mutex> lock(mutex_);
+    std::lock_guard<srw_mutex> lock(mutex_);
     std::string all;
     for (const auto& line : lines_) all += line + "\n";
     return all;
@@ -164,7 +165,7 @@ class host_process {
         std::string line = pending.substr(0, end);
         if (!line.empty() && line.back() == '\r') line.pop_back();
         pending.erase(0, end + 1);
-        std::lock_guard<std::mutex> lock(mutex_);
+        std::lock_guard<srw_mutex> lock(mutex_);
         lines_.push_back(std::move(line));
         times_.push_back(now);
         changed_.notify_all();
@@ -178,8 +179,8 @@ class host_process {
   DWORD pid_ = 0;
   bool ready_ = false;
   std::thread reader_;
-  std::mutex mutex_;
-  std::condition_variable changed_;
+  srw_mutex mutex_;
+  srw_condition_variable changed_;
   std::vector<std::string> lines_;
   std::vector<std::chrono::steady_clock::time_point> times_;
 };

@@ -7,12 +7,13 @@
 #include <windows.h>
 
 #include <chrono>
-#include <condition_variable>
 #include <cstdint>
 #include <functional>
 #include <mutex>
 #include <string>
 #include <vector>
+
+#include "platform/srw_sync.h"
 
 namespace test_support {
 
@@ -54,27 +55,27 @@ class recording_bus_observer final : public ibus_observer {
   }
 
   std::vector<notification> seen() {
-    std::lock_guard<std::mutex> lock(mutex_);
+    std::lock_guard<srw_mutex> lock(mutex_);
     return seen_;
   }
   std::vector<notification> take() {
-    std::lock_guard<std::mutex> lock(mutex_);
+    std::lock_guard<srw_mutex> lock(mutex_);
     return std::exchange(seen_, {});
   }
   bool wait_for_count(std::size_t count, std::chrono::milliseconds timeout = std::chrono::seconds(5)) {
-    std::unique_lock<std::mutex> lock(mutex_);
+    std::unique_lock<srw_mutex> lock(mutex_);
     return changed_.wait_for(lock, timeout, [&] { return seen_.size() >= count; });
   }
 
  private:
   void record(notification n) {
     if (on_call) on_call(n);
-    std::lock_guard<std::mutex> lock(mutex_);
+    std::lock_guard<srw_mutex> lock(mutex_);
     seen_.push_back(std::move(n));
     changed_.notify_all();
   }
-  std::mutex mutex_;
-  std::condition_variable changed_;
+  srw_mutex mutex_;
+  srw_condition_variable changed_;
   std::vector<notification> seen_;
 };
 

@@ -9,6 +9,8 @@
 #include <string>
 #include <vector>
 
+#include "platform/srw_sync.h"
+
 namespace test_support {
 
 struct exported {
@@ -96,7 +98,7 @@ class config_provider final : public ibus_configuration {
   }
 
   std::vector<provider_call> calls() {
-    std::lock_guard<std::mutex> lock(mutex_);
+    std::lock_guard<srw_mutex> lock(mutex_);
     return calls_;
   }
   std::vector<provider_call> calls_of(const std::string& what) {
@@ -109,10 +111,10 @@ class config_provider final : public ibus_configuration {
 
  private:
   void record(provider_call call) {
-    std::lock_guard<std::mutex> lock(mutex_);
+    std::lock_guard<srw_mutex> lock(mutex_);
     calls_.push_back(std::move(call));
   }
-  std::mutex mutex_;
+  srw_mutex mutex_;
   std::vector<provider_call> calls_;
 };
 

@@ -5,17 +5,18 @@
 #include <string>
 
 #include "gateway/parlo_ipc/parlo_ipc.h"
+#include "platform/srw_sync.h"
 
 namespace {
 
-std::mutex g_mutex;
+srw_mutex g_mutex;
 std::string g_calls;  // one call per line
 parlo::ipc::gateway::events* g_sink = nullptr;
 std::uint32_t g_results[5] = {};  // create (non-zero: null gateway), start, stop, export, import
 int g_live = 0;
 
 void record(const std::string& call) {
-  std::lock_guard<std::mutex> lock(g_mutex);
+  std::lock_guard<srw_mutex> lock(g_mutex);
   g_calls += call + "\n";
 }
 
@@ -50,7 +51,7 @@ extern "C" {
 parlo::ipc::gateway* create_gateway(parlo::bus* bus, parlo::ipc::gateway::events* sink) {
   record(std::string("create ") + (bus != nullptr ? "bus" : "null"));
   if (g_results[0] != 0) return nullptr;
-  std::lock_guard<std::mutex> lock(g_mutex);
+  std::lock_guard<srw_mutex> lock(g_mutex);
   g_sink = sink;
   ++g_live;
   return new recording_gateway();
@@ -58,7 +59,7 @@ parlo::ipc::gateway* create_gateway(parlo::bus* bus, parlo::ipc::gateway::events
 
 void destroy_gateway(parlo::ipc::gateway* gateway) {
   record("destroy");
-  std::lock_guard<std::mutex> lock(g_mutex);
+  std::lock_guard<srw_mutex> lock(g_mutex);
   delete static_cast<recording_gateway*>(gateway);
   g_sink = nullptr;
   --g_live;
@@ -66,14 +67,14 @@ void destroy_gateway(parlo::ipc::gateway* gateway) {
 
 // The sink of the live gateway, or null.
 parlo::ipc::gateway::events* IpcDoubleSink() {
-  std::lock_guard<std::mutex> lock(g_mutex);
+  std::lock_guard<srw_mutex> lock(g_mutex);
   return g_sink;
 }
 
 // Calls since the last reset, one per line, copied into `buffer`; returns
 // the full length.
 std::size_t IpcDoubleCalls(char* buffer, std::size_t capacity) {
-  std::lock_guard<std::mutex> lock(g_mutex);
+  std::lock_guard<srw_mutex> lock(g_mutex);
   if (buffer != nullptr && capacity > 0) {
     const std::size_t n = g_calls.size() < capacity - 1 ? g_calls.size() : capacity - 1;
     g_calls.copy(buffer, n);
@@ -85,13 +86,13 @@ std::size_t IpcDoubleCalls(char* buffer, std::size_t capacity) {
 // which: 0 create (non-zero makes create_gateway return null), 1 start,
 // 2 stop, 3 export, 4 import.
 void IpcDoubleSetResult(int which, std::uint32_t result) {
-  std::lock_guard<std::mutex> lock(g_mutex);
+  std::lock_guard<srw_mutex> lock(g_mutex);
   if (which >= 0 && which < 5) g_results[which] = result;
 }
 
 // Forgets the recorded calls; the results set stay.
 void IpcDoubleClearCalls() {
-  std::lock_guard<std::mutex> lock(g_mutex);
+  std::lock_guard<srw_mutex> lock(g_mutex);
   g_calls.clear();
 }
 

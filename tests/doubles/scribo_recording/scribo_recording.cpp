@@ -16,6 +16,8 @@
 #include <mutex>
 #include <string>
 
+#include "platform/srw_sync.h"
+
 namespace {
 
 struct record {
@@ -27,7 +29,7 @@ struct record {
   std::wstring format;
 };
 
-std::mutex g_mutex;
+srw_mutex g_mutex;
 std::deque<record> g_records;  // a deque keeps earlier records in place
 std::wstring g_events;
 volatile DWORD g_init_delay_ms = 0;
@@ -57,7 +59,7 @@ void append_to_events_file(const std::wstring& event) {
 
 void add_event(const std::wstring& event) {
   append_to_events_file(event);
-  std::lock_guard<std::mutex> lock(g_mutex);
+  std::lock_guard<srw_mutex> lock(g_mutex);
   if (!g_events.empty()) g_events += L',';
   g_events += event;
 }
@@ -103,13 +105,13 @@ std::int32_t LogWrite(std::int16_t depth, const std::uint32_t* level,
            fmt != nullptr ? fmt : L""};
   va_end(args);
   append_to_events_file(L"LogWrite:" + r.function);
-  std::lock_guard<std::mutex> lock(g_mutex);
+  std::lock_guard<srw_mutex> lock(g_mutex);
   g_records.push_back(std::move(r));
   return 0;
 }
 
 std::size_t ScriboDoubleCount() {
-  std::lock_guard<std::mutex> lock(g_mutex);
+  std::lock_guard<srw_mutex> lock(g_mutex);
   return g_records.size();
 }
 
@@ -117,7 +119,7 @@ std::size_t ScriboDoubleCount() {
 bool ScriboDoubleRead(std::size_t index, std::int16_t* depth,
                                             std::uint32_t* level, HMODULE* module,
                                             const wchar_t** function, const wchar_t** text) {
-  std::lock_guard<std::mutex> lock(g_mutex);
+  std::lock_guard<srw_mutex> lock(g_mutex);
   if (index >= g_records.size()) return false;
   const record& r = g_records[index];
   *depth = r.depth;
@@ -130,7 +132,7 @@ bool ScriboDoubleRead(std::size_t index, std::int16_t* depth,
 
 // The format string of line `index`; false past the end.
 bool ScriboDoubleReadFormat(std::size_t index, const wchar_t** format) {
-  std::lock_guard<std::mutex> lock(g_mutex);
+  std::lock_guard<srw_mutex> lock(g_mutex);
   if (index >= g_records.size()) return false;
   *format = g_records[index].format.c_str();
   return true;
@@ -140,14 +142,14 @@ bool ScriboDoubleReadFormat(std::size_t index, const wchar_t** format) {
 void ScriboDoubleSetInitDelay(DWORD ms) { g_init_delay_ms = ms; }
 
 void ScriboDoubleClear() {
-  std::lock_guard<std::mutex> lock(g_mutex);
+  std::lock_guard<srw_mutex> lock(g_mutex);
   g_records.clear();
   g_events.clear();
 }
 
 // The library calls other than LogWrite, comma-separated, in order.
 std::size_t ScriboDoubleEvents(wchar_t* buffer, std::size_t capacity) {
-  std::lock_guard<std::mutex> lock(g_mutex);
+  std::lock_guard<srw_mutex> lock(g_mutex);
   if (buffer != nullptr && capacity > 0) {
     const std::size_t n = g_events.size() < capacity - 1 ? g_events.size() : capacity - 1;
     g_events.copy(buffer, n);
