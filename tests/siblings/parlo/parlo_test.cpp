@@ -7,7 +7,6 @@
 #include <atomic>
 #include <chrono>
 #include <condition_variable>
-#include <cstdio>
 #include <cstring>
 #include <mutex>
 #include <string>
@@ -52,6 +51,10 @@ struct log_record {
     auto* self = static_cast<log_record*>(context);
     std::lock_guard<std::mutex> lock(self->mutex);
     self->lines.push_back(std::string(function) + ": " + text);
+  }
+  void clear() {
+    std::lock_guard<std::mutex> lock(mutex);
+    lines.clear();
   }
   bool has(const std::string& part) {
     std::lock_guard<std::mutex> lock(mutex);
@@ -134,10 +137,7 @@ class parlo_test : public ::testing::Test {
   static void SetUpTestSuite() { lib().set_log(&log_record::write, &g_log); }
   static void TearDownTestSuite() { lib().set_log(nullptr, nullptr); }
   void SetUp() override {
-    {
-      std::lock_guard<std::mutex> lock(g_log.mutex);
-      g_log.lines.clear();
-    }
+    g_log.clear();
     ASSERT_NE(nullptr, bus_ = lib().create_bus("test_bus"));
   }
   void TearDown() override {
@@ -540,7 +540,6 @@ TEST_F(parlo_test, message_fields_obey_their_limits_and_can_be_listed_copied_and
   EXPECT_NE(nullptr, message->get_blob("empty", &size)) << "present, without bytes";
   EXPECT_EQ(0u, size);
   EXPECT_EQ(nullptr, message->get_blob("absent", &size));
-  EXPECT_EQ(12u + 2 * 6 + 3 + 4 + 5, message->encoded_size());
 
   parlo::message* copy = message->copy();
   EXPECT_EQ(0u, copy->remove_blob("bin"));
@@ -639,19 +638,9 @@ TEST_F(parlo_test, round_trips_wake_threads_without_polling) {
             .count());
   }
   std::sort(micros.begin(), micros.end());
-  constexpr int burst = 20000;
-  const auto start = std::chrono::steady_clock::now();
-  for (int i = 0; i < burst; ++i) ASSERT_EQ(0u, post(ping, 0));
-  ASSERT_EQ(0u, bus_->flush(wait_ms * 4));  // the pings, which post the answers
-  ASSERT_EQ(0u, bus_->flush(wait_ms * 4));  // the answers
-  const double seconds =
-      std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count();
-  std::printf(
-      "round trip post -> callback posts back -> waiter wakes: p50 %.0f us, p99 %.0f us; "
-      "burst of %d ping-pongs: %.0f per second\n",
-      micros[rounds / 2], micros[rounds * 99 / 100], burst, burst / seconds);
   EXPECT_LT(micros[rounds / 2], 1000.0)
-      << "a delivery loop that sleeps between polls takes a millisecond or more";
+      << "a delivery loop that sleeps between polls takes a millisecond or more; p99 "
+      << micros[rounds * 99 / 100] << " us";
 }
 
 }  // namespace
