@@ -6,6 +6,7 @@
 
 #include <windows.h>
 
+#include "gateway/ipc_double.h"
 #include "registry/vorbel_impl.h"
 #include "support/config_provider.h"
 #include "support/log_capture.h"
@@ -13,35 +14,11 @@
 namespace {
 
 using test_support::config_provider;
-
-// True when the recording IPC library sits beside this program. The test
-// keeps it loaded for the whole run, so that what it recorded survives the
-// gateways that load and unload it.
-bool ipc_library_present() {
-  static const bool present = ::LoadLibraryW(L"parlo_ipc.dll") != nullptr;
-  return present;
-}
-
-// The recording double's calls since the last take, one per line.
-std::string take_ipc_calls() {
-  HMODULE module = ::GetModuleHandleW(L"parlo_ipc.dll");
-  if (module == nullptr) return "(not loaded)";
-  auto calls = reinterpret_cast<std::size_t (*)(char*, std::size_t)>(
-      reinterpret_cast<void*>(::GetProcAddress(module, "IpcDoubleCalls")));
-  auto clear = reinterpret_cast<void (*)()>(
-      reinterpret_cast<void*>(::GetProcAddress(module, "IpcDoubleClearCalls")));
-  std::string text(calls(nullptr, 0) + 1, '\0');
-  text.resize(calls(text.data(), text.size()));
-  clear();
-  return text;
-}
-
-void set_ipc_result(int which, std::uint32_t result) {
-  HMODULE module = ::GetModuleHandleW(L"parlo_ipc.dll");
-  reinterpret_cast<void (*)(int, std::uint32_t)>(
-      reinterpret_cast<void*>(::GetProcAddress(module, "IpcDoubleSetResult")))(which, result);
-}
 using test_support::has_line;
+
+// Loaded for the whole run when the recording IPC library sits beside this
+// program (the build that has one).
+gateway_test_support::ipc_controls ipc;
 
 class build : public ::testing::Test {
  protected:
@@ -49,24 +26,23 @@ class build : public ::testing::Test {
   vorbel_impl registry;
 };
 
-TEST_F(build, an_empty_configuration_gives_a_bus_without_gateway) {
+TEST_F(build, local_channels_only_give_a_bus_without_gateway) {
   config_provider provider;
-  ibus* bus = registry.create_bus("empty", &provider);
+  provider.local = {"alpha", "beta", "alpha"};  // creating an existing channel again is fine
+  ibus* bus = registry.create_bus("local", &provider);
   ASSERT_NE(nullptr, bus);
-  EXPECT_EQ(nullptr, registry.get_gateway("empty"));
-  EXPECT_TRUE(has_line(L"build_bus", L"build bus name=empty"));
+  EXPECT_EQ(nullptr, registry.get_gateway("local"));
+  EXPECT_TRUE(has_line(L"build_bus", L"build bus name=local"));
+  EXPECT_TRUE(has_line(L"build_bus", L"create_channel name=beta"));
   EXPECT_TRUE(has_line(L"build_gateway", L"exported & imported channels are empty"));
   EXPECT_TRUE(has_line(L"build_bus", L"-> build_bus()"));
-  const auto calls = provider.calls();
-  ASSERT_EQ(4u, calls.size());
-  EXPECT_EQ("local", calls[0].what);
-  EXPECT_EQ("exported", calls[1].what);
-  EXPECT_EQ("imported", calls[2].what);
-  EXPECT_EQ("is_default_bus", calls[3].what);
-  // The bus works: its local channels exist and listeners register.
-  EXPECT_EQ(0u, bus->register_listener("c", "l"));
-  EXPECT_TRUE(bus->is_registered_listener("c", "l"));
-  registry.destroy_bus("empty");
+  std::string order;
+  for (const auto& call : provider.calls()) order += call.what + " ";
+  EXPECT_EQ("local local local local exported imported is_default_bus ", order);
+  // The bus works: listeners register.
+  EXPECT_EQ(0u, bus->register_listener("alpha", "l"));
+  EXPECT_TRUE(bus->is_registered_listener("alpha", "l"));
+  registry.destroy_bus("local");
 }
 
 TEST_F(build, a_refused_local_channel_fails_the_build_and_stops_the_enumeration) {
@@ -88,17 +64,8 @@ TEST_F(build, a_refused_local_channel_fails_the_build_and_stops_the_enumeration)
   EXPECT_EQ(nullptr, registry.get_bus(nullptr));
 }
 
-TEST_F(build, local_channels_are_created_in_the_library) {
-  config_provider provider;
-  provider.local = {"alpha", "beta", "alpha"};  // creating an existing channel again is fine
-  ibus* bus = registry.create_bus("channels", &provider);
-  ASSERT_NE(nullptr, bus);
-  EXPECT_TRUE(has_line(L"build_bus", L"create_channel name=beta"));
-  registry.destroy_bus("channels");
-}
-
 TEST_F(build, imports_only_are_probed_with_fresh_cursors_and_a_gateway_failure_keeps_the_bus) {
-  if (ipc_library_present()) GTEST_SKIP() << "this build has the IPC library";
+  if (ipc.present()) GTEST_SKIP() << "this build has the IPC library";
   config_provider provider;
   provider.imports = {{"local", "\\\\.\\pipe\\p", "remote", "remote_bus"}};
   ibus* bus = registry.create_bus("importer", &provider);
@@ -117,7 +84,7 @@ TEST_F(build, imports_only_are_probed_with_fresh_cursors_and_a_gateway_failure_k
 }
 
 TEST_F(build, one_export_is_probed_then_enumerated_from_the_start_and_exported_once) {
-  if (!ipc_library_present()) GTEST_SKIP() << "needs the recording IPC library";
+  if (!ipc.present()) GTEST_SKIP() << "needs the recording IPC library";
   config_provider provider;
   provider.exports = {{"orders", "\\\\.\\pipe\\orders", false}};  // leaves link type and security alone
   ibus* bus = registry.create_bus("exporter", &provider);
@@ -135,30 +102,30 @@ TEST_F(build, one_export_is_probed_then_enumerated_from_the_start_and_exported_o
   const auto imported = provider.calls_of("imported");
   ASSERT_EQ(1u, imported.size()) << "the probe stopped at the export; the enumeration ran once";
   EXPECT_EQ(0u, imported[0].cursor);
-  const std::string calls = take_ipc_calls();
+  const std::string calls = ipc.take();
   EXPECT_NE(std::string::npos, calls.find("export orders \\\\.\\pipe\\orders 3\n")) << calls;
   EXPECT_EQ(std::string::npos, calls.find("export orders", calls.find("export orders") + 1))
       << "exported exactly once: " << calls;
   EXPECT_NE(std::string::npos, calls.find("start\n"));
   registry.destroy_bus("exporter");
-  EXPECT_EQ("stop\ndestroy\n", take_ipc_calls());
+  EXPECT_EQ("stop\ndestroy\n", ipc.take());
 }
 
 TEST_F(build, a_failed_export_stops_before_the_imports_and_keeps_the_bus) {
-  if (!ipc_library_present()) GTEST_SKIP() << "needs the recording IPC library";
+  if (!ipc.present()) GTEST_SKIP() << "needs the recording IPC library";
   config_provider provider;
   provider.exports = {{"orders", "pipe_x", true, 3, 1}};
   provider.imports = {{"local", "pipe_y", "remote", "remote_bus"}};
-  take_ipc_calls();
-  set_ipc_result(3, 50);
+  ipc.take();
+  ipc.set_result(3, 50);
   ibus* bus = registry.create_bus("failing", &provider);
-  set_ipc_result(3, 0);
+  ipc.set_result(3, 0);
   ASSERT_NE(nullptr, bus);
   EXPECT_EQ(nullptr, registry.get_gateway("failing"));
   EXPECT_TRUE(provider.calls_of("imported").empty())
       << "the probe stopped at the export it found, and the imports never started";
   EXPECT_TRUE(has_line(L"export_channels", L"export channel name=orders on pipe=pipe_x err=50"));
-  const std::string calls = take_ipc_calls();
+  const std::string calls = ipc.take();
   EXPECT_EQ(std::string::npos, calls.find("import ")) << calls;
   EXPECT_EQ(std::string::npos, calls.find("start")) << calls;
   EXPECT_NE(std::string::npos, calls.find("destroy")) << calls;

@@ -9,23 +9,13 @@
 
 #include "platform/win_error.h"
 #include "security/pipe_security.h"
+#include "security/pipes.h"
 #include "support/log_capture.h"
 
 namespace {
 
 using test_support::find_lines;
 using test_support::has_line;
-
-struct expected_ace {
-  const wchar_t* sid;
-  DWORD mask;
-};
-// In this order, each an access-allowed entry without inheritance.
-const expected_ace expected_dacl[] = {
-    {L"S-1-1-0", GENERIC_READ | GENERIC_WRITE}, {L"S-1-5-20", GENERIC_ALL},
-    {L"S-1-5-2", GENERIC_ALL},                  {L"S-1-16-4096", GENERIC_READ | GENERIC_WRITE},
-    {L"S-1-5-32-544", 0x100F0000},              {L"S-1-15-2-1", GENERIC_ALL},
-};
 
 std::wstring sid_text(PSID sid) {
   wchar_t* text = nullptr;
@@ -35,7 +25,16 @@ std::wstring sid_text(PSID sid) {
   return result;
 }
 
+// In this order, each an access-allowed entry without inheritance.
 void expect_pipes_dacl(PACL acl) {
+  const struct {
+    const wchar_t* sid;
+    DWORD mask;
+  } expected[] = {
+      {L"S-1-1-0", GENERIC_READ | GENERIC_WRITE}, {L"S-1-5-20", GENERIC_ALL},
+      {L"S-1-5-2", GENERIC_ALL},                  {L"S-1-16-4096", GENERIC_READ | GENERIC_WRITE},
+      {L"S-1-5-32-544", 0x100F0000},              {L"S-1-15-2-1", GENERIC_ALL},
+  };
   ASSERT_NE(acl, nullptr);
   ASSERT_EQ(acl->AceCount, 6u);
   for (DWORD i = 0; i < 6; ++i) {
@@ -44,23 +43,9 @@ void expect_pipes_dacl(PACL acl) {
     const auto* ace = static_cast<const ACCESS_ALLOWED_ACE*>(raw);
     EXPECT_EQ(ace->Header.AceType, ACCESS_ALLOWED_ACE_TYPE) << i;
     EXPECT_EQ(ace->Header.AceFlags, 0) << i;
-    EXPECT_EQ(ace->Mask, expected_dacl[i].mask) << i;
-    EXPECT_EQ(sid_text(const_cast<DWORD*>(&ace->SidStart)), expected_dacl[i].sid) << i;
+    EXPECT_EQ(ace->Mask, expected[i].mask) << i;
+    EXPECT_EQ(sid_text(const_cast<DWORD*>(&ace->SidStart)), expected[i].sid) << i;
   }
-}
-
-// A server pipe as the IPC library makes one: WRITE_DAC and a protected
-// initial DACL (SDDL "D:P(A;;GA;;;WD)": protected, full access for Everyone).
-HANDLE make_pipe(const wchar_t* name, DWORD extra_open_mode) {
-  PSECURITY_DESCRIPTOR initial = nullptr;
-  ::ConvertStringSecurityDescriptorToSecurityDescriptorW(L"D:P(A;;GA;;;WD)", SDDL_REVISION_1, &initial, nullptr);
-  SECURITY_ATTRIBUTES attributes{sizeof(attributes), initial, FALSE};
-  HANDLE pipe = ::CreateNamedPipeW(name, PIPE_ACCESS_DUPLEX | extra_open_mode,
-                                   PIPE_TYPE_MESSAGE | PIPE_READMODE_MESSAGE | PIPE_WAIT,
-                                   /* max_instances */ 1, /* out_buffer */ 4096, /* in_buffer */ 4096,
-                                   /* default_timeout */ 0, &attributes);
-  ::LocalFree(initial);
-  return pipe == INVALID_HANDLE_VALUE ? nullptr : pipe;
 }
 
 class pipe_security_test : public ::testing::Test {
@@ -68,66 +53,50 @@ class pipe_security_test : public ::testing::Test {
   void SetUp() override { test_support::clear_log(); }
 };
 
-TEST_F(pipe_security_test, descriptor_holds_the_six_entries_in_order) {
-  const pipes_security_descriptor sd = make_pipes_security_descriptor();
-  ASSERT_FALSE(sd.empty()) << test_support::dump_log();
-  EXPECT_EQ(sd.sacl, nullptr);
-  expect_pipes_dacl(sd.dacl);
-  // Only the DACL is ever set on a pipe.
-  EXPECT_EQ(pipe_security_information(sd), static_cast<std::uint32_t>(DACL_SECURITY_INFORMATION));
-  EXPECT_TRUE(has_line(L"make_pipes_security_descriptor", L"-> make_pipes_security_descriptor()"));
-}
-
-TEST_F(pipe_security_test, holder_moves_and_frees_once) {
+TEST_F(pipe_security_test, descriptor_holds_the_six_entries_in_order_and_moves_once) {
   pipes_security_descriptor first = make_pipes_security_descriptor();
-  const PACL dacl = first.dacl;
-  pipes_security_descriptor second(std::move(first));
-  EXPECT_TRUE(first.empty());
-  EXPECT_EQ(first.dacl, nullptr);
-  EXPECT_EQ(second.dacl, dacl);
-  pipes_security_descriptor third = make_pipes_security_descriptor();
-  third = std::move(second);
-  EXPECT_EQ(third.dacl, dacl);
-  EXPECT_TRUE(second.empty());
-  expect_pipes_dacl(third.dacl);
-  // A SACL, were one there, would be set too.
+  ASSERT_FALSE(first.empty()) << test_support::dump_log();
+  EXPECT_EQ(first.sacl, nullptr);
+  expect_pipes_dacl(first.dacl);
+  // Only the DACL is ever set on a pipe; a SACL, were one there, would be too.
+  EXPECT_EQ(pipe_security_information(first), static_cast<std::uint32_t>(DACL_SECURITY_INFORMATION));
   ACL sacl{};
   pipes_security_descriptor with_sacl;
   with_sacl.sacl = &sacl;
   EXPECT_EQ(pipe_security_information(with_sacl), static_cast<std::uint32_t>(SACL_SECURITY_INFORMATION));
   with_sacl.sacl = nullptr;
+
+  // Moves leave one owner, so the block is freed once.
+  const PACL dacl = first.dacl;
+  pipes_security_descriptor second(std::move(first));
+  EXPECT_TRUE(first.empty());
+  EXPECT_EQ(first.dacl, nullptr);
+  pipes_security_descriptor third = make_pipes_security_descriptor();
+  third = std::move(second);
+  EXPECT_TRUE(second.empty());
+  EXPECT_EQ(third.dacl, dacl);
+  expect_pipes_dacl(third.dacl);
 }
 
-TEST_F(pipe_security_test, applied_dacl_reads_back_from_the_pipe) {
+TEST_F(pipe_security_test, applied_dacl_reads_back_from_the_pipe_and_refusals_carry_the_code) {
   const pipes_security_descriptor sd = make_pipes_security_descriptor();
-  winapi::unique_handle pipe(make_pipe(L"\\\\.\\pipe\\vorbel_security_test_apply", WRITE_DAC));
+  const winapi::unique_handle pipe = security_test::make_pipe(L"\\\\.\\pipe\\vorbel_security_test_apply");
   ASSERT_TRUE(pipe);
   std::error_code code = winapi::make_win_error(1);
   ASSERT_TRUE(apply_pipe_security(pipe.get(), sd, code)) << test_support::dump_log();
   EXPECT_FALSE(code);
+  expect_pipes_dacl(security_test::dacl_of(pipe.get()).dacl);
 
-  PACL dacl = nullptr;
-  PSECURITY_DESCRIPTOR read_back = nullptr;
-  ASSERT_EQ(::GetSecurityInfo(pipe.get(), SE_FILE_OBJECT, DACL_SECURITY_INFORMATION, nullptr, nullptr, &dacl,
-                              nullptr, &read_back),
-            static_cast<DWORD>(ERROR_SUCCESS));
-  expect_pipes_dacl(dacl);
-  ::LocalFree(read_back);
-}
-
-TEST_F(pipe_security_test, refusals_carry_the_system_code) {
-  const pipes_security_descriptor sd = make_pipes_security_descriptor();
-  winapi::unique_handle pipe(make_pipe(L"\\\\.\\pipe\\vorbel_security_test_no_write_dac", 0));
-  ASSERT_TRUE(pipe);
-  std::error_code code;
-  EXPECT_FALSE(apply_pipe_security(pipe.get(), sd, code));
+  const winapi::unique_handle no_write_dac =
+      security_test::make_pipe(L"\\\\.\\pipe\\vorbel_security_test_no_write_dac", 0);
+  ASSERT_TRUE(no_write_dac);
+  EXPECT_FALSE(apply_pipe_security(no_write_dac.get(), sd, code));
   EXPECT_EQ(code.value(), static_cast<int>(ERROR_ACCESS_DENIED));
   const auto lines = find_lines(L"apply_pipe_security", L"SetSecurityInfo err=5");
   ASSERT_EQ(lines.size(), 1u) << test_support::dump_log();
   EXPECT_EQ(lines[0].level, 4u);
-
   // An empty holder never reaches the system.
-  EXPECT_FALSE(apply_pipe_security(pipe.get(), pipes_security_descriptor(), code));
+  EXPECT_FALSE(apply_pipe_security(no_write_dac.get(), pipes_security_descriptor(), code));
   EXPECT_EQ(code.value(), static_cast<int>(ERROR_INVALID_PARAMETER));
 }
 
@@ -159,7 +128,6 @@ TEST_F(pipe_security_test, security_privilege_is_enabled) {
   std::error_code code = winapi::make_win_error(1);
   EXPECT_TRUE(adjust_process_priviledges(code)) << test_support::dump_log();
   EXPECT_FALSE(code);
-  EXPECT_TRUE(has_line(L"adjust_process_priviledges", L"-> adjust_process_priviledges()"));
   EXPECT_FALSE(has_line(L"adjust_process_priviledges", L"err="));
 }
 

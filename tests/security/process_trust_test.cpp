@@ -5,9 +5,7 @@
 #include <windows.h>
 #include <winternl.h>
 
-#include <algorithm>
 #include <chrono>
-#include <cstdio>
 #include <future>
 #include <thread>
 #include <vector>
@@ -64,14 +62,6 @@ std::wstring quoted(const std::wstring& path) {
   return text + L"\"";
 }
 
-TEST(trust_level_test, names) {
-  EXPECT_STREQ(trust_level_name(trust_level::low_trust), L"low_trust");
-  EXPECT_STREQ(trust_level_name(trust_level::high_trust), L"high_trust");
-  EXPECT_STREQ(trust_level_name(trust_level::untrusted), L"untrusted");
-  EXPECT_STREQ(trust_level_name(trust_level::unknown), L"unknown");
-  EXPECT_STREQ(trust_level_name(static_cast<trust_level>(4)), L"");
-}
-
 TEST(process_info_test, orders_by_creation_time_then_pid_then_path) {
   EXPECT_TRUE(key(0xFFFFFFFF, 9, L"C:\\z", 1) < key(0, 1, L"C:\\a", 2));  // high half first
   EXPECT_TRUE(key(1) < key(0x80000000));                                   // unsigned low half
@@ -82,26 +72,6 @@ TEST(process_info_test, orders_by_creation_time_then_pid_then_path) {
   // Both slashes separate elements: the same path either way.
   EXPECT_FALSE(key(5, 7, L"C:\\a\\b.exe") < key(5, 7, L"C:/a/b.exe"));
   EXPECT_FALSE(key(5, 7, L"C:/a/b.exe") < key(5, 7, L"C:\\a\\b.exe"));
-}
-
-TEST(get_process_info_test, reads_a_real_process) {
-  FILETIME before{};
-  ::GetSystemTimeAsFileTime(&before);
-  const std::wstring path = image_path(L"child_a");
-  child_process child(path);
-  ASSERT_TRUE(child.running());
-  FILETIME after{};
-  ::GetSystemTimeAsFileTime(&after);
-
-  const process_info info = get_process_info(child.pid(), winapi::open_process(0x410, child.pid()).get());
-  EXPECT_EQ(info.pid, child.pid());
-  EXPECT_EQ(::CompareStringOrdinal(info.image_path.c_str(), -1, path.c_str(), -1, TRUE), CSTR_EQUAL)
-      << info.image_path.wstring();
-  auto ticks = [](const FILETIME& t) { return (std::uint64_t{t.dwHighDateTime} << 32) | t.dwLowDateTime; };
-  constexpr std::uint64_t slack = 200 * 10000;  // 200 ms in 100 ns units: clock granularity
-  EXPECT_GE(ticks(info.creation_time) + slack, ticks(before));
-  EXPECT_LE(ticks(info.creation_time), ticks(after) + slack);
-  EXPECT_TRUE(child.stop());
 }
 
 TEST(get_process_info_test, throws_with_the_system_code) {
@@ -147,7 +117,7 @@ TEST_F(signature_checker_test, refusals_say_why) {
   EXPECT_EQ(lines[0].level, 8u);
 }
 
-TEST(signature_checker_without_signature_test, never_grants_high_trust) {
+TEST_F(signature_checker_test, a_checker_without_our_signer_never_grants_high_trust) {
   signature_checker none{std::nullopt};
   EXPECT_FALSE(none.has_signature());
   EXPECT_EQ(none.get_process_trust(image_path(L"child_a")), trust_level::low_trust);
@@ -283,10 +253,23 @@ TEST_F(trust_cache_test, destruction_while_waiting_stops_the_thread_and_closes_h
   for (std::size_t i = 0; i < 10; ++i) EXPECT_TRUE(p.closed_by_cache(i)) << i;
 }
 
-TEST_F(trust_cache_test, real_process_is_cached_until_it_exits) {
-  child_process child(image_path(L"child_a"));
+TEST_F(trust_cache_test, real_process_is_read_and_cached_until_it_exits) {
+  FILETIME before{};
+  ::GetSystemTimeAsFileTime(&before);
+  const std::wstring path = image_path(L"child_a");
+  child_process child(path);
   ASSERT_TRUE(child.running());
+  FILETIME after{};
+  ::GetSystemTimeAsFileTime(&after);
   const process_info info = get_process_info(child.pid(), winapi::open_process(0x410, child.pid()).get());
+  EXPECT_EQ(info.pid, child.pid());
+  EXPECT_EQ(::CompareStringOrdinal(info.image_path.c_str(), -1, path.c_str(), -1, TRUE), CSTR_EQUAL)
+      << info.image_path.wstring();
+  auto ticks = [](const FILETIME& t) { return (std::uint64_t{t.dwHighDateTime} << 32) | t.dwLowDateTime; };
+  constexpr std::uint64_t slack = 200 * 10000;  // 200 ms in 100 ns units: clock granularity
+  EXPECT_GE(ticks(info.creation_time) + slack, ticks(before));
+  EXPECT_LE(ticks(info.creation_time), ticks(after) + slack);
+
   processes_trust_cache cache;
   cache.add(info, winapi::open_process(SYNCHRONIZE, child.pid()), trust_level::high_trust);
   EXPECT_EQ(cache.find(info), trust_level::high_trust);
@@ -298,31 +281,6 @@ TEST_F(trust_cache_test, real_process_is_cached_until_it_exits) {
   ASSERT_TRUE(child.stop());
   EXPECT_TRUE(wait_until([&] { return cache.find(info) == trust_level::unknown; }));
   EXPECT_EQ(cache.size(), 0u);
-}
-
-TEST_F(trust_cache_test, classification_costs_against_a_lookup) {
-  signature_checker checker{get_current_signature()};
-  const std::wstring path = image_path(L"child_a");
-  processes_trust_cache cache;
-  const process_info info = key(1, 1, path.c_str());
-  cache.add(info, winapi::unique_handle(::CreateEventW(nullptr, TRUE, FALSE, nullptr)), trust_level::high_trust);
-
-  auto median_us = [](auto&& operation) {
-    std::vector<double> samples;
-    for (int run = 0; run < 25; ++run) {
-      const auto start = std::chrono::steady_clock::now();
-      operation();
-      samples.push_back(std::chrono::duration<double, std::micro>(std::chrono::steady_clock::now() - start).count());
-    }
-    std::sort(samples.begin(), samples.end());
-    return samples[samples.size() / 2];
-  };
-  const double classify = median_us([&] { EXPECT_EQ(checker.get_process_trust(path), trust_level::high_trust); });
-  const double lookup = median_us([&] { EXPECT_EQ(cache.find(info), trust_level::high_trust); });
-  std::printf("median over 25 runs: get_process_trust %.1f us, find %.2f us\n", classify, lookup);
-  RecordProperty("get_process_trust_us", std::to_string(classify));
-  RecordProperty("find_us", std::to_string(lookup));
-  EXPECT_LT(lookup, classify);
 }
 
 }  // namespace
