@@ -219,7 +219,9 @@ TEST(vorbel_host_test, bad_configuration_and_usage_exit_before_loading_with_a_me
     host_process host(arguments);
     EXPECT_EQ(host.exit_code(), c.code) << message;
     EXPECT_NE(host.err_text().find(message), std::string::npos) << message << "\n" << host.err_text();
-    if (c.code == 2) EXPECT_TRUE(host.out_lines().empty()) << message;  // nothing loaded
+    if (c.code == 2) {
+      EXPECT_TRUE(host.out_lines().empty()) << message;  // nothing loaded
+    }
   }
 }
 
