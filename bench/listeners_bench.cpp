@@ -160,7 +160,10 @@ int run_propagation() {
     std::fprintf(stderr, "vorbel_bench: the peer never heard this process's table\n");
     return 1;
   }
-  peer.send("watch print");
+  if (peer.request("watch print", "ok watch").empty()) {
+    std::fprintf(stderr, "vorbel_bench: the peer did not take \"watch print\"\n");
+    return 1;
+  }
   const std::string payload(64, 'x');
   std::vector<double> raw_us;
   std::vector<double> propagation_us;
@@ -271,7 +274,10 @@ int run_convergence(const std::vector<std::size_t>& sizes) {
     const double raw_ms = ticks_to_us(now_ticks() - raw_start) / 1000;
     std::fprintf(stderr, "convergence N=%zu: raw pipe %.0f ms\n", n, raw_ms);
 
-    peer.send("watch count " + std::to_string(n));
+    if (peer.request("watch count " + std::to_string(n), "ok watch").empty()) {
+      std::fprintf(stderr, "vorbel_bench: the peer did not take \"watch count\"\n");
+      return 1;
+    }
     std::vector<std::string> ids;
     for (const listener& item : table) ids.push_back(item.id);
     const std::int64_t start = now_ticks();

@@ -10,9 +10,12 @@
 //                    and count what arrives on "vorbel_service"
 //                                                      -> "ok bus" / "error bus"
 //   watch print      print "+ ID TICKS" / "- ID TICKS" for every listener of
-//                    another process that appears / goes
+//                    another process that appears / goes  -> "ok watch"
 //   watch count N    print "all N TICKS" when the other processes' listeners
-//                    number N
+//                    number N                              -> "ok watch"
+// A caller waits for "ok watch" before it changes any listener: the
+// notifications run on the bus's own thread and would otherwise race the
+// command.
 //   service          after the queued deliveries: "service pubs=P bytes=B
 //                    empty=E removed=R": listeners messages of other
 //                    processes with at least one listener (P, their blob
@@ -179,6 +182,7 @@ int run_peer() {
         words >> target;
         observer.count_to(target);
       }
+      print_line("ok watch");
     } else if (command == "service") {
       if (side) side->messaging()->flush(10000);
       print_line("service pubs=" + std::to_string(service.publications.load()) +

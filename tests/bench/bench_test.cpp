@@ -183,7 +183,7 @@ TEST(bench_peer, the_peer_counts_what_the_convergence_table_is_made_of) {
   // The handshake: this process's empty table, on connect and on request.
   ASSERT_TRUE(test_support::wait_until([&] { return service(peer).empty >= 2; }, 20s));
 
-  peer.send("watch print");
+  ASSERT_FALSE(peer.request("watch print", "ok watch").empty());
   const listener_list table = bench::make_listener_table(3);
   const std::int64_t start = bench::now_ticks();
   std::size_t exact = 0;
@@ -198,7 +198,7 @@ TEST(bench_peer, the_peer_counts_what_the_convergence_table_is_made_of) {
     ASSERT_FALSE(line.empty()) << item.id;
     EXPECT_GT(std::stoll(line.substr(line.find_last_of(' ') + 1)), start) << "one clock for both processes";
   }
-  peer.send("watch count 3");
+  ASSERT_FALSE(peer.request("watch count 3", "ok watch").empty());
   EXPECT_FALSE(peer.take_line("all 3 ", 10s).empty()) << "B already holds all three";
 
   service_line counted = service(peer);
@@ -206,7 +206,7 @@ TEST(bench_peer, the_peer_counts_what_the_convergence_table_is_made_of) {
   EXPECT_EQ(exact, counted.bytes);
   EXPECT_EQ(0u, counted.removed);
 
-  peer.send("watch print");
+  ASSERT_FALSE(peer.request("watch print", "ok watch").empty());
   ASSERT_EQ(0u, side.bus()->unregister_listener(bench::bench_channel, table.front().id.c_str()));
   EXPECT_FALSE(peer.take_line("- " + table.front().id + " ", 10s).empty());
   counted = service(peer);
