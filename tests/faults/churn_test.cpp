@@ -13,10 +13,12 @@
 #include <cstdio>
 #include <cstdlib>
 #include <string>
+#include <system_error>
 #include <thread>
 #include <vector>
 
 #include "faults/fault_support.h"
+#include "platform/win_api.h"
 
 namespace {
 
@@ -75,20 +77,26 @@ TEST_F(churn_test, connect_kill_cycles_give_back_every_handle_and_the_memory) {
 
   std::size_t most_trusted = 0;
   // One peer's life: starts, is admitted, publishes, learns ours, is killed.
-  auto cycle = [&](long i) -> bool {
+  // Empty when it went through; otherwise the step that failed, the peer's
+  // output and this cycle's log.
+  auto cycle = [&](long i) -> std::string {
+    test_support::clear_log();  // the recording log would grow with every cycle
     const std::string id = "c" + std::to_string(i);
     auto peer = start_host(L"host_a", L"cycler", importing(pipe));
-    if (!peer->ready()) return false;
+    auto failed = [&](const char* step) {
+      std::error_code ignored;
+      return std::string(step) + "\n--- peer output:\n" + peer->output() + "\n--- log:\n" +
+             winapi::utf16_to_utf8(dump_log(), ignored);
+    };
+    if (!peer->ready()) return failed("the peer did not start");
     peer->send("register alerts " + id);
-    if (!server.observer.wait_has(peer->pid(), "alerts", id)) return false;
-    if (!peer->wait_for(plus(own(), "server"))) return false;
+    if (!server.observer.wait_has(peer->pid(), "alerts", id)) return failed("its listener did not arrive");
+    if (!peer->wait_for(plus(own(), "server"))) return failed("it did not learn our listener");
     most_trusted = std::max(most_trusted, server.events().trusted_process_count());
     const DWORD pid = peer->pid();
     peer->kill();
-    if (!server.observer.wait_gone(pid)) return false;
-    peer.reset();
-    test_support::clear_log();  // the recording log would grow with every cycle
-    return true;
+    if (!server.observer.wait_gone(pid)) return failed("its listener was not purged after the kill");
+    return {};
   };
   // No peer, no trust entry, no connection: what the process holds at rest.
   auto settle = [&] {
@@ -105,7 +113,8 @@ TEST_F(churn_test, connect_kill_cycles_give_back_every_handle_and_the_memory) {
   long warm_up = 0;
   for (long steady = 0; steady < 5 && warm_up < 30; ++warm_up) {
     const DWORD handles = measure_self().handles;
-    ASSERT_TRUE(cycle(-1 - warm_up)) << "warm-up " << warm_up << "\n" << dump_log();
+    const std::string failure = cycle(-1 - warm_up);
+    ASSERT_EQ("", failure) << "warm-up " << warm_up;
     ASSERT_TRUE(settle());
     steady = measure_self().handles == handles ? steady + 1 : 0;
   }
@@ -115,7 +124,8 @@ TEST_F(churn_test, connect_kill_cycles_give_back_every_handle_and_the_memory) {
   const auto start = clock::now();
   long done = 0;
   while (done < cycles && seconds_since(start) < budget_s) {
-    ASSERT_TRUE(cycle(done)) << "cycle " << done << "\n" << dump_log();
+    const std::string failure = cycle(done);
+    ASSERT_EQ("", failure) << "cycle " << done;
     ++done;
   }
   const double took = seconds_since(start);
