@@ -6,6 +6,7 @@
 #include <windows.h>
 
 #include <chrono>
+#include <cstdio>
 #include <filesystem>
 #include <fstream>
 #include <functional>
@@ -49,33 +50,28 @@ class host_process {
  public:
   // Starts `image` with `--config <config> --log <log> --stdin` and waits
   // for its "ready" line.
+  //
+  // Under Wine a process start now and then never reaches the program's
+  // first line (about once in a thousand starts, loaded machine or not): no
+  // output, no log, the process still running. Such a start is ended and
+  // made once more, and said on standard error; a program that printed
+  // anything is never started again, so its own failures stay visible.
   host_process(const std::wstring& image, const std::wstring& config, const std::wstring& log) {
-    SECURITY_ATTRIBUTES inherit{sizeof(inherit), nullptr, TRUE};
-    HANDLE child_in = nullptr;
-    HANDLE child_out = nullptr;
-    ::CreatePipe(&child_in, &input_, &inherit, 0);
-    ::CreatePipe(&output_, &child_out, &inherit, 0);
-    ::SetHandleInformation(input_, HANDLE_FLAG_INHERIT, 0);
-    ::SetHandleInformation(output_, HANDLE_FLAG_INHERIT, 0);
-    STARTUPINFOW startup{};
-    startup.cb = sizeof(startup);
-    startup.dwFlags = STARTF_USESTDHANDLES;
-    startup.hStdInput = child_in;
-    startup.hStdOutput = child_out;
-    startup.hStdError = child_out;
     std::wstring command = L"\"" + image + L"\" --config \"" + config + L"\" --log \"" + log + L"\" --stdin";
-    PROCESS_INFORMATION info{};
-    if (::CreateProcessW(image.c_str(), command.data(), nullptr, nullptr, /* inherit_handles */ TRUE,
-                         /* flags */ 0, nullptr, nullptr, &startup, &info)) {
-      process_ = info.hProcess;
-      pid_ = info.dwProcessId;
-      ::CloseHandle(info.hThread);
+    for (int attempt = 0; attempt < 2; ++attempt) {
+      if (attempt > 0) {
+        std::fprintf(stderr, "host_process: %ls: %s; starting it again\n", image.c_str(), start_failure_.c_str());
+        end_process();
+      }
+      start(image, command);
+      ready_ = wait_line([](const std::string& l) { return l.rfind("ready ", 0) == 0; },
+                         std::chrono::seconds(20));
+      if (ready_ || !output().empty()) break;
+      start_failure_ = process_ == nullptr ? "CreateProcess err=" + std::to_string(create_error_)
+                       : running()        ? std::string("nothing printed in 20 s, still running")
+                                          : "exited with code " + std::to_string(exit_code()) +
+                                                " before printing anything";
     }
-    ::CloseHandle(child_in);
-    ::CloseHandle(child_out);
-    reader_ = std::thread([this] { read_lines(); });
-    ready_ = wait_line([](const std::string& l) { return l.rfind("ready ", 0) == 0; },
-                       std::chrono::seconds(20));
   }
   host_process(const host_process&) = delete;
   host_process& operator=(const host_process&) = delete;
@@ -84,13 +80,12 @@ class host_process {
       send("quit");
       if (::WaitForSingleObject(process_, 5000) != WAIT_OBJECT_0) ::TerminateProcess(process_, 1);
     }
-    close_input();
-    if (reader_.joinable()) reader_.join();
-    if (output_ != nullptr) ::CloseHandle(output_);
-    if (process_ != nullptr) ::CloseHandle(process_);
+    end_process();
   }
 
   bool ready() const { return ready_; }
+  // Why the last start printed nothing; empty when it did.
+  const std::string& start_failure() const { return start_failure_; }
   DWORD pid() const { return pid_; }
   bool running() const { return ::WaitForSingleObject(process_, 0) == WAIT_TIMEOUT; }
 
@@ -149,6 +144,55 @@ class host_process {
   }
 
  private:
+  void start(const std::wstring& image, std::wstring& command) {
+    SECURITY_ATTRIBUTES inherit{sizeof(inherit), nullptr, TRUE};
+    HANDLE child_in = nullptr;
+    HANDLE child_out = nullptr;
+    ::CreatePipe(&child_in, &input_, &inherit, 0);
+    ::CreatePipe(&output_, &child_out, &inherit, 0);
+    ::SetHandleInformation(input_, HANDLE_FLAG_INHERIT, 0);
+    ::SetHandleInformation(output_, HANDLE_FLAG_INHERIT, 0);
+    STARTUPINFOW startup{};
+    startup.cb = sizeof(startup);
+    startup.dwFlags = STARTF_USESTDHANDLES;
+    startup.hStdInput = child_in;
+    startup.hStdOutput = child_out;
+    startup.hStdError = child_out;
+    PROCESS_INFORMATION info{};
+    if (::CreateProcessW(image.c_str(), command.data(), nullptr, nullptr, /* inherit_handles */ TRUE,
+                         /* flags */ 0, nullptr, nullptr, &startup, &info)) {
+      process_ = info.hProcess;
+      pid_ = info.dwProcessId;
+      ::CloseHandle(info.hThread);
+    } else {
+      create_error_ = ::GetLastError();
+    }
+    ::CloseHandle(child_in);
+    ::CloseHandle(child_out);
+    reader_ = std::thread([this] { read_lines(); });
+  }
+  // Ends the process if it still runs and lets go of everything of it.
+  void end_process() {
+    if (process_ != nullptr && running()) {
+      ::TerminateProcess(process_, 1);
+      ::WaitForSingleObject(process_, 10000);
+    }
+    close_input();
+    if (reader_.joinable()) reader_.join();
+    if (output_ != nullptr) ::CloseHandle(output_);
+    output_ = nullptr;
+    if (process_ != nullptr) ::CloseHandle(process_);
+    process_ = nullptr;
+    pid_ = 0;
+    std::lock_guard<srw_mutex> lock(mutex_);
+    lines_.clear();
+    times_.clear();
+  }
+  DWORD exit_code() const {
+    DWORD code = 0;
+    ::GetExitCodeProcess(process_, &code);
+    return code;
+  }
   void close_input() {
     if (input_ != nullptr) ::CloseHandle(input_);
     input_ = nullptr;
@@ -177,7 +221,9 @@ class host_process {
   HANDLE output_ = nullptr;
   HANDLE process_ = nullptr;
   DWORD pid_ = 0;
+  DWORD create_error_ = 0;
   bool ready_ = false;
+  std::string start_failure_;
   std::thread reader_;
   srw_mutex mutex_;
   srw_condition_variable changed_;

@@ -88,7 +88,7 @@ TEST_F(churn_test, connect_kill_cycles_give_back_every_handle_and_the_memory) {
       return std::string(step) + "\n--- peer output:\n" + peer->output() + "\n--- log:\n" +
              winapi::utf16_to_utf8(dump_log(), ignored);
     };
-    if (!peer->ready()) return failed("the peer did not start");
+    if (!peer->ready()) return failed(("the peer did not start: " + peer->start_failure()).c_str());
     peer->send("register alerts " + id);
     if (!server.observer.wait_has(peer->pid(), "alerts", id)) return failed("its listener did not arrive");
     if (!peer->wait_for(plus(own(), "server"))) return failed("it did not learn our listener");
