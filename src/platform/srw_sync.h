@@ -2,9 +2,11 @@
 // and condition variable, usable with std::lock_guard and std::unique_lock.
 //
 // With the mingw-w64 runtime, std::mutex and std::condition_variable go
-// through kernel semaphores: a hand-off to a waiting thread cost about 15
-// times as much under Wine (144 against 10 microseconds). Code on the path
-// of every message or notification uses these instead.
+// through kernel objects: a hand-off to a waiting thread cost about 15 times
+// as much under Wine (144 against 10 microseconds), and a mutex makes an
+// event the first time it is contended and keeps it, so a long-lived lock
+// adds a handle at some unforeseeable moment. Every lock of the component
+// and of the sibling stand-ins is one of these instead.
 #pragma once
 
 #include <windows.h>
