@@ -1,30 +1,55 @@
 // The reader/writer lock driven from real threads.
 #include <gtest/gtest.h>
 
-#include <atomic>
-#include <thread>
-#include <vector>
+#include <windows.h>
 
+#include <cstdlib>
+#include <functional>
+#include <future>
+#include <memory>
+
+#include "platform/handles.h"
 #include "platform/sync_rw_lock.h"
 #include "support/log_capture.h"
-#include "thread_actor.h"
 
-namespace {
+using namespace std::chrono_literals;
+using call = std::shared_future<void>;
 
-using test_support::done;
-using test_support::settle_time;
-using test_support::thread_actor;
+bool done(const call& c, std::chrono::milliseconds within = 5s) { return c.wait_for(within) == std::future_status::ready; }
 
-bool ready(const std::shared_future<void>& call) { return done(call, std::chrono::milliseconds(0)); }
+// A thread of its own that runs the calls posted to it (as APCs, between its
+// alertable waits) one after another, so that one thread can take a lock and,
+// later, release it. The lock's own waits are not alertable.
+class thread_actor {
+ public:
+  ~thread_actor() {
+    if (!done(post([this] { stop_ = true; }), 10s)) std::abort();  // a lock was never handed on
+    ::WaitForSingleObject(thread_.get(), INFINITE);
+  }
+  call post(std::function<void()> fn) {
+    auto task = std::make_unique<std::packaged_task<void()>>(std::move(fn));
+    call result = task->get_future().share();
+    ::QueueUserAPC([](ULONG_PTR p) { (*std::unique_ptr<std::packaged_task<void()>>(reinterpret_cast<std::packaged_task<void()>*>(p)))(); },
+                   thread_.get(), reinterpret_cast<ULONG_PTR>(task.release()));
+    return result;
+  }
+
+ private:
+  bool stop_ = false;  // set and read on the actor's own thread
+  winapi::unique_handle thread_{::CreateThread(nullptr, 0, [](void* stop) -> DWORD {
+    while (!*static_cast<bool*>(stop)) ::SleepEx(INFINITE, /* alertable */ TRUE);
+    return 0;
+  }, &stop_, 0, nullptr)};
+};
 
 struct rw_lock_test : ::testing::Test {
   CSyncRWLock lock;
-  thread_actor a, b, c, d, e, f;  // destroyed before the lock
+  thread_actor a, b, c, d, e;  // destroyed before the lock
 
-  std::shared_future<void> read(thread_actor& t) { return t.call([this] { lock.LockRead(0); }); }
-  std::shared_future<void> unread(thread_actor& t) { return t.call([this] { lock.UnlockRead(0); }); }
-  std::shared_future<void> write(thread_actor& t) { return t.call([this] { lock.LockWrite(0); }); }
-  std::shared_future<void> unwrite(thread_actor& t) { return t.call([this] { lock.UnlockWrite(0); }); }
+  call read(thread_actor& t) { return t.post([this] { lock.LockRead(0); }); }
+  call unread(thread_actor& t) { return t.post([this] { lock.UnlockRead(0); }); }
+  call write(thread_actor& t) { return t.post([this] { lock.LockWrite(0); }); }
+  call unwrite(thread_actor& t) { return t.post([this] { lock.UnlockWrite(0); }); }
   // Waits until exactly these numbers of threads are blocked in the lock.
   bool blocked(std::uint32_t readers, std::uint32_t writers) {
     return test_support::wait_until([&] {
@@ -34,90 +59,34 @@ struct rw_lock_test : ::testing::Test {
   }
 };
 
-TEST_F(rw_lock_test, WriterWaitsUntilBothReadersUnlock) {
-  ASSERT_TRUE(done(read(a)) && done(read(b)));
-  const auto w = write(c);
-  EXPECT_FALSE(done(w, settle_time));
-  EXPECT_TRUE(done(unread(a)));
-  EXPECT_FALSE(done(w, settle_time));
-  EXPECT_TRUE(done(unread(b)));
-  EXPECT_TRUE(done(w) && done(unwrite(c)));
-}
-
-TEST_F(rw_lock_test, WaitingWriterHoldsOffNewReadersButNotNestedReads) {
+// Writer preference: a waiting writer holds off new readers (but not a
+// reader reading again) and, when a writer leaves, goes before them.
+TEST_F(rw_lock_test, WritersGoFirstButReadersNestAndWaitingReadersEnterTogether) {
   ASSERT_TRUE(done(read(a)));
-  const auto w = write(b);
+  const auto w1 = write(b);
   ASSERT_TRUE(blocked(0, 1));
-  const auto r = read(c);
-  EXPECT_TRUE(blocked(1, 1));
-  EXPECT_TRUE(done(read(a)) && done(unread(a)));  // a reading thread reads again at once
-  EXPECT_FALSE(done(w, settle_time));
-  EXPECT_TRUE(done(unread(a)) && done(w));
-  EXPECT_FALSE(done(r, settle_time));  // the writer went first
-  EXPECT_TRUE(done(unwrite(b)) && done(r) && done(unread(c)));
+  const auto r1 = read(c), r2 = read(d);
+  ASSERT_TRUE(blocked(2, 1));
+  EXPECT_TRUE(done(read(a)) && done(unread(a)));
+  EXPECT_FALSE(done(w1, 100ms));  // a still reads
+  EXPECT_TRUE(done(unread(a)) && done(w1));
+  const auto w2 = write(e);
+  ASSERT_TRUE(blocked(2, 1));
+  EXPECT_TRUE(done(unwrite(b)) && done(w2));
+  EXPECT_FALSE(done(r1, 0ms) || done(r2, 0ms));
+  EXPECT_TRUE(done(unwrite(e)) && done(r1) && done(r2));
+  EXPECT_EQ(lock.GetCounters().active_readers, 2u);
+  EXPECT_TRUE(done(unread(c)) && done(unread(d)));
 }
 
 TEST_F(rw_lock_test, WriterReadsAndWritesRecursivelyAndLeavesAfterTheLastUnlock) {
-  ASSERT_TRUE(done(a.call([this] {
+  ASSERT_TRUE(done(a.post([this] {
     for (int i = 0; i < 2; ++i) lock.LockWrite(0), lock.LockRead(0);
   })));
   const auto r = read(b);
   ASSERT_TRUE(blocked(1, 0));
-  EXPECT_TRUE(done(a.call([this] { lock.UnlockWrite(0), lock.UnlockRead(0), lock.UnlockWrite(0); })));
-  EXPECT_FALSE(done(r, settle_time));  // one read is still held
+  EXPECT_TRUE(done(a.post([this] { lock.UnlockWrite(0), lock.UnlockRead(0), lock.UnlockWrite(0); })));
+  EXPECT_FALSE(done(r, 100ms));  // one read is still held
   EXPECT_TRUE(done(unread(a)) && done(r) && done(unread(b)));
 }
 
-TEST_F(rw_lock_test, LeavingWriterHandsOverToWritersThenToAllReaders) {
-  ASSERT_TRUE(done(write(a)));
-  const auto w1 = write(b), w2 = write(c);
-  ASSERT_TRUE(blocked(0, 2));
-  const std::shared_future<void> reads[] = {read(d), read(e), read(f)};
-  ASSERT_TRUE(blocked(3, 2));
-  EXPECT_TRUE(done(unwrite(a)));
-  ASSERT_TRUE(test_support::wait_until([&] { return ready(w1) || ready(w2); }));
-  const bool b_first = ready(w1);
-  EXPECT_FALSE(done(b_first ? w2 : w1, settle_time));
-  EXPECT_TRUE(done(unwrite(b_first ? b : c)) && done(b_first ? w2 : w1));
-  for (const auto& r : reads) EXPECT_FALSE(ready(r));
-  EXPECT_TRUE(done(unwrite(b_first ? c : b)));
-  for (const auto& r : reads) EXPECT_TRUE(done(r));
-  EXPECT_EQ(lock.GetCounters().active_readers, 3u);  // all three in at once
-  for (thread_actor* t : {&d, &e, &f}) EXPECT_TRUE(done(unread(*t)));
-}
-
-TEST_F(rw_lock_test, WritersExcludeEveryoneUnderContention) {
-  std::atomic<int> writers{0}, readers{0}, violations{0};
-  std::vector<std::thread> threads;
-  for (int t = 0; t < 4; ++t) {
-    threads.emplace_back([&, t] {
-      for (int i = 0; i < 500; ++i) {
-        if ((i + t) % 3 == 0) {
-          rw_write_guard guard(lock);
-          violations += writers.fetch_add(1) != 0 || readers.load() != 0;
-          std::this_thread::yield();
-          writers.fetch_sub(1);
-        } else {
-          rw_read_guard guard(lock), nested(lock);
-          readers.fetch_add(1);
-          violations += writers.load() != 0;
-          readers.fetch_sub(1);
-        }
-      }
-    });
-  }
-  for (auto& t : threads) t.join();
-  EXPECT_EQ(violations.load(), 0);
-  const auto n = lock.GetCounters();
-  EXPECT_EQ(n.active_readers + n.active_writer + n.waiting_readers + n.waiting_writers, 0u);
-}
-
-TEST(rw_lock_DeathTest, BrokenRulesEndTheProcess) {
-  EXPECT_DEATH({ CSyncRWLock l; l.UnlockRead(0); }, "read lock released but not held");
-  EXPECT_DEATH({ CSyncRWLock l; l.LockWrite(0); l.UnlockRead(0); }, "read lock released but not held");
-  EXPECT_DEATH({ CSyncRWLock l; l.LockRead(0); l.LockWrite(0); }, "write lock asked for while reading");
-  EXPECT_DEATH({ CSyncRWLock l; std::thread([&] { l.LockWrite(0); }).join(); l.UnlockWrite(0); },
-               "write lock released but not held");
-}
-
-}  // namespace
