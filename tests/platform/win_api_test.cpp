@@ -9,11 +9,11 @@
 
 #include "platform/win_api.h"
 
-TEST(win_api_test, ThrowingWrappersCarryTheCallsOwnErrorAndName) {
-  ASSERT_EQ(::OpenProcess(PROCESS_QUERY_LIMITED_INFORMATION, FALSE, 0xFFFFFFF8), nullptr);
+TEST(win_api_test, ThrownErrorsAreTheCallsOwnAndHolderResetKeepsTheLastError) {
+  ASSERT_EQ(::OpenProcess(PROCESS_QUERY_LIMITED_INFORMATION, FALSE, 0xFFFFFFF8), nullptr);  // no such process
   const DWORD open_error = ::GetLastError();
   try {
-    winapi::open_process(PROCESS_QUERY_LIMITED_INFORMATION, 0xFFFFFFF8);  // far above any process id
+    winapi::open_process(PROCESS_QUERY_LIMITED_INFORMATION, 0xFFFFFFF8);
     ADD_FAILURE() << "nothing thrown";
   } catch (const std::system_error& e) {
     EXPECT_EQ(e.code(), winapi::make_win_error(open_error));
@@ -21,14 +21,11 @@ TEST(win_api_test, ThrowingWrappersCarryTheCallsOwnErrorAndName) {
   }
   // Codes without a system text are printed unsigned.
   EXPECT_EQ(std::error_code(-2, winapi::win_error_category()).message(), "unknown error 4294967294");
-}
 
-TEST(win_api_test, HolderResetKeepsTheLastErrorAndMoveClosesWhatWasHeld) {
-  winapi::unique_handle first(::CreateEventW(nullptr, TRUE, FALSE, nullptr)), second(::CreateEventW(nullptr, TRUE, FALSE, nullptr));
+  winapi::unique_handle first(::CreateEventW(nullptr, TRUE, FALSE, nullptr));
   const HANDLE replaced = first.get();
-  first = std::move(second);
-  DWORD flags = 0;
-  EXPECT_FALSE(::GetHandleInformation(replaced, &flags));
+  first = winapi::unique_handle(::CreateEventW(nullptr, TRUE, FALSE, nullptr));
+  EXPECT_EQ(WAIT_FAILED, ::WaitForSingleObject(replaced, 0)) << "the replaced handle is still open";
   winapi::unique_handle bogus(reinterpret_cast<HANDLE>(0x7FF0));  // its close fails
   for (auto* holder : {&first, &bogus}) {
     ::SetLastError(1234);
