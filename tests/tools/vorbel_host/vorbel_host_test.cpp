@@ -7,6 +7,7 @@
 
 #include <filesystem>
 #include <fstream>
+#include <iterator>
 #include <sstream>
 #include <string>
 #include <tuple>
@@ -23,9 +24,8 @@ void write_file(const std::wstring& name, const std::string& text) {
   std::ofstream(std::filesystem::path(in_dir(name)), std::ios::binary | std::ios::trunc) << text;
 }
 std::string read_file(const std::wstring& name) {
-  std::stringstream text;
-  text << std::ifstream(std::filesystem::path(in_dir(name)), std::ios::binary).rdbuf();
-  return text.str();
+  std::ifstream in(std::filesystem::path(in_dir(name)), std::ios::binary);
+  return std::string(std::istreambuf_iterator<char>(in), {});
 }
 
 struct run {
@@ -37,32 +37,25 @@ struct run {
 run run_host(const std::vector<std::wstring>& arguments, const std::string& input = "") {
   write_file(L"in.txt", input);
   SECURITY_ATTRIBUTES inherit{sizeof inherit, nullptr, TRUE};
-  winapi::unique_handle in(::CreateFileW(in_dir(L"in.txt").c_str(), GENERIC_READ, FILE_SHARE_READ, &inherit,
-                                         OPEN_EXISTING, 0, nullptr));
-  winapi::unique_handle out(::CreateFileW(in_dir(L"out.txt").c_str(), GENERIC_WRITE, FILE_SHARE_READ, &inherit,
-                                          CREATE_ALWAYS, 0, nullptr));
-  const std::wstring exe = in_dir(L"vorbel_host.exe");
-  std::wstring command = L"\"" + exe + L"\"";
+  auto open = [&](const wchar_t* name, DWORD access, DWORD disposition) {
+    return ::CreateFileW(in_dir(name).c_str(), access, FILE_SHARE_READ, &inherit, disposition, 0, nullptr);
+  };
+  winapi::unique_handle in(open(L"in.txt", GENERIC_READ, OPEN_EXISTING));
+  winapi::unique_handle out(open(L"out.txt", GENERIC_WRITE, CREATE_ALWAYS));
+  std::wstring command = L"vorbel_host.exe";
   for (const std::wstring& a : arguments) command += L" \"" + a + L"\"";
   STARTUPINFOW startup{};
   startup.cb = sizeof startup;
   startup.dwFlags = STARTF_USESTDHANDLES;
   startup.hStdInput = in.get(), startup.hStdOutput = out.get(), startup.hStdError = out.get();
   PROCESS_INFORMATION info{};
-  run result;
-  if (!::CreateProcessW(exe.c_str(), &command[0], nullptr, nullptr, /* inherit_handles */ TRUE, DETACHED_PROCESS,
-                        nullptr, nullptr, &startup, &info)) {
-    ADD_FAILURE() << "CreateProcess err=" << ::GetLastError();
-    return result;
-  }
+  EXPECT_TRUE(::CreateProcessW(in_dir(L"vorbel_host.exe").c_str(), &command[0], nullptr, nullptr,
+                               /* inherit_handles */ TRUE, DETACHED_PROCESS, nullptr, nullptr, &startup, &info));
   winapi::unique_handle process(info.hProcess), thread(info.hThread);
+  run result;
   result.pid = info.dwProcessId;
-  if (::WaitForSingleObject(process.get(), 30000) != WAIT_OBJECT_0) {
-    ADD_FAILURE() << "vorbel_host did not end";
-    ::TerminateProcess(process.get(), 99);
-    ::WaitForSingleObject(process.get(), 5000);
-  }
-  ::GetExitCodeProcess(process.get(), &result.code);
+  if (::WaitForSingleObject(process.get(), 30000) != WAIT_OBJECT_0) ::TerminateProcess(process.get(), 99);
+  ::GetExitCodeProcess(process.get(), &result.code);  // 99 or STILL_ACTIVE when it hung
   result.text = read_file(L"out.txt");
   return result;
 }
@@ -74,20 +67,14 @@ TEST(vorbel_host_test, bad_configuration_usage_and_failed_commands_exit_with_the
       {R"({"exported_channel": []})", {}, 2, "exported_channel: unknown field"},
       {R"({"local_channels": ["a\u0000b"]})", {}, 2, "local_channels[0]: must not contain a NUL"},
       {R"({"exported_channels": [{"channel": "a"}]})", {}, 2, "exported_channels[0].pipe: missing"},
-      {R"({"exported_channels": [{"channel": "a", "pipe": "p", "security": true}]})", {}, 2,
-       "exported_channels[0].security: must be 0 or 1, found true"},
-      {R"({"imported_channels": [{"channel": "a", "pipe": "p", "remote_channel": "a", "remote_bus": "b",
-           "link_type": 4294967296}]})", {}, 2,
-       "imported_channels[0].link_type: must be a whole number from 0 to 4294967295, found 4294967296"},
-      {nullptr, {L"--config", L"no_such_file.json"}, 2, "configuration \"no_such_file.json\": cannot open the file: err=2"},
+      {R"({"exported_channels": [{"channel": "a", "pipe": "p", "link_type": 4294967296}]})", {}, 2,
+       "exported_channels[0].link_type: must be a whole number from 0 to 4294967295, found 4294967296"},
+      {nullptr, {L"--config", L"none.json"}, 2, "configuration \"none.json\": cannot open the file: err=2"},
       {nullptr, {L"--bogus"}, 2, "unknown option \"--bogus\""},
-      {nullptr, {L"--exec", L"sleep 86400001"}, 2, "sleep: MS must be a number of milliseconds from 0 to 86400000"},
       {nullptr, {L"--dll-dir", in_dir(L"empty"), L"--exec", L"list"}, 3, "cannot load vorbel.dll from"},
-      {nullptr, {L"--exec", L"wait-for a x any 200", L"--exec", L"echo not reached"}, 1,
-       "wait-for a x any 200: timed out after 200 ms"},
-      {nullptr, {L"--keep-going", L"--exec", L"register a x", L"--exec", L"wait-for a x", L"--exec",
-                 L"wait-for-absent a x self 100", L"--exec", L"echo went on"}, 1,
-       "timed out after 100 ms (the listener is still there)\nwent on"},
+      {nullptr, {L"--exec", L"wait-for a x any 200", L"--exec", L"echo not reached"}, 1, "timed out after 200 ms"},
+      {nullptr, {L"--keep-going", L"--exec", L"wait-for a x any 100", L"--exec", L"echo went on"}, 1,
+       "wait-for a x any 100: timed out after 100 ms (the listener did not appear)\nwent on"},
   };
   ::CreateDirectoryW(in_dir(L"empty").c_str(), nullptr);
   for (auto [json, arguments, code, message] : cases) {
@@ -129,7 +116,7 @@ TEST(vorbel_host_test, scripted_run_through_commands_and_notifications_with_the_
   const std::string pid = std::to_string(r.pid), log_path = std::filesystem::path(in_dir(L"text.log")).string();
   std::string notes, answers;
   std::istringstream lines(r.text);
-  for (std::string line; std::getline(lines, line);) (line[0] == '+' || line[0] == '-' ? notes : answers) += line + "\n";
+  for (std::string l; std::getline(lines, l);) (l[0] == '+' || l[0] == '-' ? notes : answers) += l + '\n';
   const std::string ax = "pid=" + pid + " channel=a id=x\n", by = "pid=" + pid + " channel=b id=y\n";
   const std::string odd = "pid=" + pid + " channel=a\\x01 id=x\\x7f\xff\n";  // control bytes escaped
   EXPECT_EQ(notes, "+ " + ax + "+ " + ax + "+ " + odd + "+ " + by + "- " + ax + "- " + ax);
