@@ -32,9 +32,7 @@ TEST(build, exports_are_probed_then_enumerated_from_the_start_and_each_pipe_carr
   provider.exports = {{"orders", "\\\\.\\pipe\\p1", false}, {"prices", "\\\\.\\pipe\\p1", true, 7, 1}};
   provider.imports = {{"local", "pipe_b", "remote", "remote_bus"}, {"local2", "pipe_b", "remote2", "remote_bus"}};
   ASSERT_NE(nullptr, registry.create_bus("exporter", &provider));
-  std::string cursors;
-  for (const auto& call : provider.calls_of("exported")) cursors += std::to_string(call.cursor);
-  EXPECT_EQ("0012", cursors) << "the probe, then the enumeration from the first element";
+  EXPECT_EQ("0012", provider.exported_cursors) << "the probe, then the enumeration from the first element";
   EXPECT_EQ(
       "create bus\n"
       "export orders \\\\.\\pipe\\p1 3\n"

@@ -20,8 +20,6 @@ Fn export_of(const char* name) {
 
 }  // namespace
 
-bool log_capture_available() { return export_of<count_fn>("ScriboDoubleCount") != nullptr; }
-
 std::vector<log_line> log_lines() {
   std::vector<log_line> lines;
   auto count = export_of<count_fn>("ScriboDoubleCount");

@@ -20,9 +20,6 @@ struct log_line {
   std::wstring text;
 };
 
-// False when the recording double is not loaded in this process.
-bool log_capture_available();
-
 // Every line written since the last clear, in order.
 std::vector<log_line> log_lines();
 // Lines of `function` (all functions when empty) whose text contains `part`.
