@@ -17,7 +17,6 @@
 set -euo pipefail
 source "$(dirname "$0")/common.sh"
 
-WINE=/usr/lib/wine/wine64
 RUN_DIR="$BUILD_DIR/bench-run"
 NATIVE_DIR="$BUILD_DIR/bench-native"
 DOC="$ROOT/docs/benchmarks.md"

@@ -9,7 +9,6 @@ set -euo pipefail
 source "$(dirname "$0")/common.sh"
 
 DEMO_DIR="$BUILD_DIR/demo"
-WINE=/usr/lib/wine/wine64
 HOST="$BUILD_DIR/bin/vorbel_host.exe"
 # The same program signed by another signer (built for the tests).
 OTHER_HOST="$BUILD_DIR/tests/bin/e2e_hosts/host_b.exe"
