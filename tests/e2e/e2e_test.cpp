@@ -83,4 +83,24 @@ TEST_F(e2e_test, processes_exchange_tables_and_rejoin_a_restarted_server) {
   EXPECT_TRUE(server->wait_for(plus(own(), "c1"), 20s)) << server->output();
 }
 
+// A listener too large for any message is refused with 87 and a line,
+// instead of being taken and making every later publication unreadable: the
+// process's later listeners still reach its peer, and the peer never sees a
+// publication without its table.
+TEST_F(e2e_test, an_oversized_listener_is_refused_and_later_ones_still_reach_the_peer) {
+  const std::string pipe = "\\\\.\\pipe\\vorbel_e2e_oversize";
+  this_process us({{pipe, 0}}, {}, "before");
+  ASSERT_TRUE(us.up()) << dump_log();
+  auto peer = start_host("host_a", "oversize_peer", host_config({pipe}));
+  ASSERT_TRUE(peer->ready()) << peer->output();
+  ASSERT_TRUE(peer->wait_for(plus(own(), "before"), 20s)) << peer->output();
+  const std::string huge(16u << 20, 'h');
+  EXPECT_EQ(87u, us.bus().register_listener("alerts", huge.c_str()));
+  EXPECT_TRUE(has_line(L"bus::register_listener", L"id longer than 65536 bytes")) << dump_log();
+  EXPECT_EQ(0u, us.bus().register_listener("alerts", "after"));
+  EXPECT_TRUE(peer->wait_for(plus(own(), "after"), 20s)) << peer->output();
+  EXPECT_EQ(std::string::npos, read_file("oversize_peer.log").find("params blob")) << "the peer got an empty publication";
+  EXPECT_FALSE(has_line(L"comm::service_channel::publish_listeners", L"")) << dump_log();
+}
+
 }  // namespace

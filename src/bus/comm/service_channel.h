@@ -9,20 +9,16 @@
 // registry's mutex, through the gateway.
 #pragma once
 
+#include <cstddef>
 #include <cstdint>
 #include <memory>
 #include <set>
 #include <string>
 
 #include "bus/listener.h"
+#include "bus/parlo/parlo.h"
 
 struct ibus;
-
-namespace parlo {
-class channel;
-class message;
-class subscription;
-}  // namespace parlo
 
 namespace parlo::ipc {
 class gateway;
@@ -31,6 +27,12 @@ class gateway;
 namespace comm {
 
 constexpr const char* service_channel_name = "vorbel_service";
+// The blob of a listeners message, and the largest message it can hold: the
+// messaging library carries at most parlo::max_message_size bytes of blobs
+// in one message, their names included.
+constexpr const char* listeners_blob_name = "params";
+constexpr std::uint64_t max_listeners_message_size =
+    parlo::max_message_size - std::char_traits<char>::length(listeners_blob_name);
 
 enum class service_channel_messages_id : std::uint32_t {
   publish_listeners = 1,  // no content: asks every receiver to publish
@@ -64,9 +66,10 @@ class service_channel {
   std::uint32_t export_channel(parlo::ipc::gateway* ipc, const char* pipe);
   std::uint32_t import_channel(parlo::ipc::gateway* ipc, const char* bus_name, const char* pipe);
 
-  // Posts this process's listeners. Called under the bus's mutex: it must not
-  // call back into the bus.
-  std::uint32_t publish_listeners(std::uint32_t pid, const listener_list& listeners);
+  // Posts an encoded listeners message (listeners_codec.h) as message id 2.
+  // 0, or the messaging library's refusal of the blob or of the post,
+  // logged; nothing is posted without its blob.
+  std::uint32_t publish_listeners(const std::uint8_t* bytes, std::size_t size);
   // Asks every process on the channel to publish its listeners.
   std::uint32_t request_remote_listeners();
 
