@@ -159,17 +159,22 @@ TEST_F(bus_test, a_burst_is_published_in_few_whole_tables_ending_with_the_last) 
 }
 
 // A peer that asks again and again is answered at the publisher's pace, not
-// once per request; the answer is the table as it is.
+// once per request: a table of 10,000 listeners (520 KB) asked for every
+// millisecond for half a second goes out a handful of times.
 TEST_F(bus_test, requests_are_answered_at_the_publishers_pace) {
-  for (int i = 0; i < 1000; ++i) b.register_listener("asked", std::to_string(100000 + i).c_str());
+  for (int i = 0; i < 10000; ++i) b.register_listener("asked", std::to_string(100000 + i).c_str());
   settle();
-  constexpr int requests = 500;
-  for (int i = 0; i < requests; ++i) post(messaging, 1, nullptr, 0, /* with_blob */ false);
+  const auto start = std::chrono::steady_clock::now();
+  int requests = 0;
+  for (; std::chrono::steady_clock::now() - start < 500ms; ++requests) {
+    post(messaging, 1, nullptr, 0, /* with_blob */ false);
+    ::Sleep(1);
+  }
   settle();
   const std::vector<listener_list> tables = own_tables();
   ASSERT_FALSE(tables.empty()) << "requests were not answered";
-  EXPECT_LE(tables.size(), std::size_t{requests / 10});
-  EXPECT_EQ(1000u, tables.back().size());
+  EXPECT_LE(tables.size(), 20u) << requests << " requests";
+  EXPECT_EQ(10000u, tables.back().size());
 }
 
 // A post the messaging library refuses (its queue is full) is not lost: the
@@ -192,12 +197,12 @@ TEST_F(bus_test, a_refused_publication_is_logged_and_the_newest_table_goes_again
   b.register_listener("q", "1");
   EXPECT_TRUE(test_support::wait_for_line(L"publisher::run", L"publication failed err=1816; the table goes again in"))
       << test_support::dump_log();
-  b.register_listener("q", "2");
+  // Nothing changes any more: only the retry can bring the table out.
   ::SetEvent(release.get());
   settle();
   const std::vector<listener_list> tables = own_tables();
   ASSERT_FALSE(tables.empty()) << "the refused publication was never made again";
-  EXPECT_EQ((listener_list{{"q", "1"}, {"q", "2"}}), tables.back());
+  EXPECT_EQ((listener_list{{"q", "1"}}), tables.back());
 }
 
 // A name over the documented limit, or a listener that would make the table

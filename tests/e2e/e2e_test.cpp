@@ -91,6 +91,7 @@ TEST_F(e2e_test, an_oversized_listener_is_refused_and_later_ones_still_reach_the
   const std::string pipe = "\\\\.\\pipe\\vorbel_e2e_oversize";
   this_process us({{pipe, 0}}, {}, "before");
   ASSERT_TRUE(us.up()) << dump_log();
+  write_file("oversize_peer.log", "");  // the logging library appends
   auto peer = start_host("host_a", "oversize_peer", host_config({pipe}));
   ASSERT_TRUE(peer->ready()) << peer->output();
   ASSERT_TRUE(peer->wait_for(plus(own(), "before"), 20s)) << peer->output();
