@@ -36,8 +36,10 @@ class publication_pacer {
 
   static constexpr double burst_share = 1.0 / 3;
   static constexpr std::chrono::milliseconds max_burst_gap{1000};
-  // A quarter of what a 2-core machine under load moved through the
-  // gateway into a peer's table (bench/analysis.md).
+  // A quarter to a third of what whole tables sent back to back moved
+  // through the gateway into a peer's table on a loaded 2-core machine
+  // (23-31 MB/s, bench/analysis.md): room for the peer's other traffic and
+  // for a slower moment.
   static constexpr double pipe_bytes_per_second = 8e6;
   static constexpr std::chrono::milliseconds min_retry{10};
   static constexpr std::chrono::milliseconds max_retry{1000};
