@@ -163,6 +163,7 @@ std::uint32_t bus::unregister_listener(const char* channel, const char* id) {
 }
 
 void bus::log_change_locked(bool added, const listener& item) {
+  if (!keeps_changes_) return;
   if (!own_changes_.empty() && own_changes_.back().added != added && own_changes_.back().item == item) {
     own_changes_.pop_back();
     return;
@@ -306,7 +307,10 @@ void bus::on_remote_error(const char*, std::uint32_t, std::uint32_t) {}
 
 void bus::subscribe() {
   service_channel_ = comm::make_service_channel(this);
-  if (!service_channel_) return;
+  if (!service_channel_) {
+    stop_keeping_changes();
+    return;
+  }
   service_channel_->subscribe(this);
   // From here the publisher's thread reads `service_channel_`.
   publisher_.enable();
@@ -314,5 +318,12 @@ void bus::subscribe() {
 
 void bus::unsubscribe() {
   publisher_.stop();
+  stop_keeping_changes();
   service_channel_.reset();
+}
+
+void bus::stop_keeping_changes() {
+  std::lock_guard<srw_mutex> lock(mutex_);
+  keeps_changes_ = false;
+  own_changes_.clear();
 }

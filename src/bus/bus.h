@@ -103,6 +103,8 @@ class bus final : public qm::observable<ibus_observer_base*, ibus>,
 
   // Appends a change for the publisher; under `mutex_`.
   void log_change_locked(bool added, const listener& item);
+  // Nothing will publish this bus's table: changes are no longer kept.
+  void stop_keeping_changes();
   // Takes the changes under `mutex_`, applies them to `published_`, encodes
   // and posts it; runs on the publisher's thread.
   publisher::outcome send_table();
@@ -133,6 +135,9 @@ class bus final : public qm::observable<ibus_observer_base*, ibus>,
   std::unordered_map<listener, std::size_t, listener_hash> own_;
   std::uint64_t own_bytes_ = comm::listeners_fixed_bound;
   std::vector<own_change> own_changes_;
+  // False once it is clear that nothing will take the changes (no service
+  // channel, or unsubscribed): they are then not kept.
+  bool keeps_changes_ = true;
   // Other processes' listeners, as they published them.
   std::map<std::uint32_t, listener_list> listeners_;
   // Connections per remote process, as the gateway's events told them.

@@ -64,12 +64,13 @@ class publication_pacer {
 
 // Sends this process's table from a thread of its own whenever it changed.
 //
-// Owned by the bus. Any thread may mark the table changed; the bus does so
-// under its mutex, so this object's lock comes after the bus's. The thread
-// calls `send` without holding its lock; `send` takes the bus's mutex to
-// encode and posts outside it. Nothing is sent before enable() (marks are
-// kept); stop(), which the destructor also runs, ends and joins the thread,
-// and `send` is not called after it returns. A mark after stop() is ignored.
+// Owned by the bus. Any thread may mark the table changed; its lock is held
+// only for its own bookkeeping, and no other lock is taken under it (the bus
+// marks after releasing its mutex). The thread calls `send` without holding
+// it; `send` takes the bus's mutex to hand over the changes and encodes and
+// posts outside it. Nothing is sent before enable() (marks are kept);
+// stop(), which the destructor also runs, ends and joins the thread, and
+// `send` is not called after it returns. A mark after stop() is ignored.
 class publisher {
  public:
   // What `send` did: the post's result (0 when posted) and the bytes sent.
