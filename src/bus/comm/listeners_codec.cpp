@@ -2,7 +2,7 @@
 
 #include <algorithm>
 
-#include "listeners_message_generated.h"
+#include "bus/comm/listeners_build.h"
 
 namespace comm {
 namespace {
@@ -12,70 +12,13 @@ std::string copy_to_first_zero(const flatbuffers::String* text) {
   return std::string(bytes, std::find(bytes, bytes + text->size(), '\0'));
 }
 
-// Builds the message into `builder`, which must be empty.
-template <typename Listeners>
-void build_listeners(flatbuffers::FlatBufferBuilder& builder, std::uint32_t pid,
-                     const Listeners& listeners) {
-  std::vector<flatbuffers::Offset<wire::listener>> tables;
-  tables.reserve(listeners.size());
-  for (const listener& item : listeners) {
-    // The id string is made first and the id field added first: peers may
-    // compare buffers byte for byte.
-    const auto id = builder.CreateString(item.id);
-    const auto channel = builder.CreateString(item.channel);
-    wire::listenerBuilder table(builder);
-    table.add_id(id);
-    table.add_channel(channel);
-    tables.push_back(table.Finish());
-  }
-  const auto vector = builder.CreateVector(tables);
-  wire::listeners_messageBuilder root(builder);
-  root.add_listeners(vector);
-  root.add_pid(pid);  // a pid of 0 is the default and is left out
-  builder.Finish(root.Finish());
-}
-
-// At least 1 KB, and room for the whole message up front: a builder that
-// regrows copies everything built so far each time, which made large tables
-// cost several times their size.
-template <typename Listeners>
-std::size_t expected_size(const Listeners& listeners) {
-  std::uint64_t expected = listeners_fixed_bound;
-  for (const listener& item : listeners) expected += listener_encoded_bound(item.channel.size(), item.id.size());
-  return static_cast<std::size_t>(std::max<std::uint64_t>(1024, expected));
-}
-
 }  // namespace
 
 std::vector<std::uint8_t> encode_listeners(std::uint32_t pid, const listener_list& listeners) {
-  flatbuffers::FlatBufferBuilder builder(expected_size(listeners));
-  build_listeners(builder, pid, listeners);
+  flatbuffers::FlatBufferBuilder builder(build::expected_size(listeners));
+  build::build_listeners(builder, pid, listeners);
   return std::vector<std::uint8_t>(builder.GetBufferPointer(),
                                    builder.GetBufferPointer() + builder.GetSize());
-}
-
-struct listeners_encoder::state {
-  flatbuffers::FlatBufferBuilder builder{1024};
-  // What the builder was made for; expected_size is an upper bound of the
-  // message, so the builder never grows beyond it.
-  std::size_t capacity = 1024;
-};
-
-listeners_encoder::listeners_encoder() : state_(std::make_unique<state>()) {}
-listeners_encoder::~listeners_encoder() = default;
-
-listeners_encoder::bytes listeners_encoder::encode(std::uint32_t pid, const listener_set& listeners) {
-  const std::size_t expected = expected_size(listeners);
-  // Kept while the table needs at least a quarter of it; a table that
-  // shrank a lot gives the memory back.
-  if (state_->capacity < expected || state_->capacity / 4 > expected) {
-    state_->builder = flatbuffers::FlatBufferBuilder(expected);
-    state_->capacity = expected;
-  } else {
-    state_->builder.Clear();
-  }
-  build_listeners(state_->builder, pid, listeners);
-  return bytes{state_->builder.GetBufferPointer(), state_->builder.GetSize()};
 }
 
 bool verify_listeners(const std::uint8_t* data, std::size_t size, std::uint32_t& pid) {
