@@ -23,8 +23,9 @@ struct ibus_observer_base : IQmBaseInterface {};
 
 // Listener notifications. They run on the bus's own notification thread, one
 // at a time. The strings are valid only during the call. From inside a
-// notification an observer may call the bus's listener operations but must not
-// add or remove observers of the same bus.
+// notification an observer may call the bus's listener operations and the
+// registry (ivorbel) but must not add or remove observers of the same bus,
+// nor give back the bus's last use.
 struct ibus_observer : ibus_observer_base {
   // `pid` is the process in which the listener is registered.
   virtual void on_new_listener(std::uint32_t pid, const char* channel, const char* id) = 0;

@@ -58,12 +58,15 @@ bus::bus(const char* name)
       observer_list_(&observer_list()) {}
 
 bus::~bus() {
-  // The service channel goes first: until its subscription is released a
-  // delivery thread may still hand a message to this bus, which would lock a
-  // destroyed mutex.
+  // The notifier stops first: the notification in progress may call back
+  // into this bus (an observer may register a listener), so it finishes
+  // while everything is in place; the queued ones are dropped.
+  notifier_.stop();
+  // Then the service channel: until its subscription is released a delivery
+  // thread may still hand a message to this bus, which would use the table.
   service_channel_.reset();
-  // Then, by declaration order: the mutex and the table, the notifier (its
-  // queued tasks dropped), the messaging bus, the library, the observers.
+  // Then, by declaration order: the mutex and the table, the stopped
+  // notifier, the messaging bus, the library, the observers.
 }
 
 void* bus::GetInterface(GUID iid) {
