@@ -198,10 +198,11 @@ void bus::drop_process(std::uint32_t pid) {
   // A disconnect whose connect came before this bus observed the gateway
   // finds no count: that was the process's last known connection too.
   auto count = connections_.find(pid);
-  if (count == connections_.end() || --count->second == 0) {
-    if (count != connections_.end()) connections_.erase(count);
-    mark_departed_locked(pid);
-  }
+  // With another connection left the process is still there, and it will
+  // not publish its list again: its listeners stay.
+  if (count != connections_.end() && --count->second != 0) return;
+  if (count != connections_.end()) connections_.erase(count);
+  mark_departed_locked(pid);
   auto entry = listeners_.find(pid);
   if (entry == listeners_.end()) return;
   listener_list gone = std::move(entry->second);

@@ -92,6 +92,7 @@ class bus final : public qm::observable<ibus_observer_base*, ibus>,
 
   std::uint32_t publish_locked();
   void on_connect(std::uint32_t pid);
+  // A connection to process `pid` ended; its listeners go with its last one.
   void drop_process(std::uint32_t pid);
   // Notes that process `pid` has no connection left that this bus heard of.
   void mark_departed_locked(std::uint32_t pid);

@@ -100,7 +100,10 @@ bool gateway_observer::on_local_connect(parlo::ipc::pipe_handle pipe, std::uint3
       << L"pid=" << pid << L" handle=" << pipe;
   if (!is_allowed(pipe, pid)) return false;
   apply_security(pipe);
-  context_->pool.post(make_connection_insert(&context_->connections, pipe, pid));
+  // The name is read now: the handle is the library's, closed soon after the
+  // disconnect.
+  context_->pool.post(
+      make_connection_insert(&context_->connections, pipe, get_pipe_name(pipe), pid));
   post_event(gateway_event::local_connect, pipe, pid);
   return true;
 }
@@ -133,7 +136,8 @@ bool gateway_observer::on_remote_connect(parlo::ipc::pipe_handle pipe, std::uint
   logging::trace_scope trace(L"gateway_observer::on_remote_connect");
   logger_stream(level_info, L"gateway_observer::on_remote_connect")
       << L"pid=" << pid << L" handle=" << pipe;
-  context_->pool.post(make_connection_insert(&context_->connections, pipe, pid));
+  context_->pool.post(
+      make_connection_insert(&context_->connections, pipe, get_pipe_name(pipe), pid));
   post_event(gateway_event::remote_connect, pipe, pid);
   return true;
 }
