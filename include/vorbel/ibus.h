@@ -39,13 +39,14 @@ struct ibus_base : IQmBaseInterface {};
 struct ibus : ibus_base, qm::iobservable<ibus_observer_base*> {
   // The messaging library's bus object, on which the host does its messaging.
   virtual void* get_messaging_bus() = 0;
-  // 0, or 87 for a null argument. Registering the same pair twice keeps two
-  // entries.
+  // 0, 87 for a null argument, or 14 (ERROR_OUTOFMEMORY) when memory ran
+  // out. Registering the same pair twice keeps two entries.
   virtual std::uint32_t register_listener(const char* channel, const char* id) = 0;
-  // Removes one entry equal to the pair. 0 (also when none was registered), or
-  // 87 for a null argument.
+  // Removes one entry equal to the pair. 0 (also when none was registered), 87
+  // for a null argument, or 14 when memory ran out.
   virtual std::uint32_t unregister_listener(const char* channel, const char* id) = 0;
-  // True when this process or any connected process has the listener.
+  // True when this process or any connected process has the listener (false,
+  // with a line in the log, when memory ran out).
   virtual bool is_registered_listener(const char* channel, const char* id) = 0;
 
  protected:

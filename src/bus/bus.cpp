@@ -85,7 +85,7 @@ void* bus::GetInterface(GUID iid) {
 
 void* bus::get_messaging_bus() { return messaging_bus_.get(); }
 
-std::uint32_t bus::register_listener(const char* channel, const char* id) {
+std::uint32_t bus::register_listener(const char* channel, const char* id) try {
   logging::trace_scope trace(L"bus::register_listener");
   if (channel == nullptr) {
     logger_stream(level_error, L"bus::register_listener") << L"channel is nullptr";
@@ -101,9 +101,12 @@ std::uint32_t bus::register_listener(const char* channel, const char* id) {
   post_new_listener(notifier_, observer_list_, pid_, item);
   publish_locked();
   return 0;
+} catch (...) {
+  logging::log_current_exception(L"bus::register_listener");
+  return ERROR_OUTOFMEMORY;
 }
 
-std::uint32_t bus::unregister_listener(const char* channel, const char* id) {
+std::uint32_t bus::unregister_listener(const char* channel, const char* id) try {
   logging::trace_scope trace(L"bus::unregister_listener");
   if (channel == nullptr) {
     logger_stream(level_error, L"bus::unregister_listener") << L"channel is nullptr";
@@ -123,9 +126,12 @@ std::uint32_t bus::unregister_listener(const char* channel, const char* id) {
   post_listener_removed(notifier_, observer_list_, pid_, item);
   publish_locked();
   return 0;
+} catch (...) {
+  logging::log_current_exception(L"bus::unregister_listener");
+  return ERROR_OUTOFMEMORY;
 }
 
-bool bus::is_registered_listener(const char* channel, const char* id) {
+bool bus::is_registered_listener(const char* channel, const char* id) try {
   if (channel == nullptr) {
     logger_stream(level_error, L"bus::is_registered_listener") << L"channel is nullptr";
     return false;
@@ -139,6 +145,9 @@ bool bus::is_registered_listener(const char* channel, const char* id) {
   for (const auto& [pid, list] : listeners_) {
     if (std::find(list.begin(), list.end(), item) != list.end()) return true;
   }
+  return false;
+} catch (...) {
+  logging::log_current_exception(L"bus::is_registered_listener");
   return false;
 }
 
