@@ -58,12 +58,15 @@ bus::bus(const char* name)
       observer_list_(&observer_list()) {}
 
 bus::~bus() {
-  // The service channel goes first: until its subscription is released a
-  // delivery thread may still hand a message to this bus, which would lock a
-  // destroyed mutex.
+  // The notifier stops first: the notification in progress may call back
+  // into this bus (an observer may register a listener), so it finishes
+  // while everything is in place; the queued ones are dropped.
+  notifier_.stop();
+  // Then the service channel: until its subscription is released a delivery
+  // thread may still hand a message to this bus, which would use the table.
   service_channel_.reset();
-  // Then, by declaration order: the mutex and the table, the notifier (its
-  // queued tasks dropped), the messaging bus, the library, the observers.
+  // Then, by declaration order: the mutex and the table, the stopped
+  // notifier, the messaging bus, the library, the observers.
 }
 
 void* bus::GetInterface(GUID iid) {
@@ -82,7 +85,7 @@ void* bus::GetInterface(GUID iid) {
 
 void* bus::get_messaging_bus() { return messaging_bus_.get(); }
 
-std::uint32_t bus::register_listener(const char* channel, const char* id) {
+std::uint32_t bus::register_listener(const char* channel, const char* id) try {
   logging::trace_scope trace(L"bus::register_listener");
   if (channel == nullptr) {
     logger_stream(level_error, L"bus::register_listener") << L"channel is nullptr";
@@ -98,9 +101,12 @@ std::uint32_t bus::register_listener(const char* channel, const char* id) {
   post_new_listener(notifier_, observer_list_, pid_, item);
   publish_locked();
   return 0;
+} catch (...) {
+  logging::log_current_exception(L"bus::register_listener");
+  return ERROR_OUTOFMEMORY;
 }
 
-std::uint32_t bus::unregister_listener(const char* channel, const char* id) {
+std::uint32_t bus::unregister_listener(const char* channel, const char* id) try {
   logging::trace_scope trace(L"bus::unregister_listener");
   if (channel == nullptr) {
     logger_stream(level_error, L"bus::unregister_listener") << L"channel is nullptr";
@@ -120,9 +126,12 @@ std::uint32_t bus::unregister_listener(const char* channel, const char* id) {
   post_listener_removed(notifier_, observer_list_, pid_, item);
   publish_locked();
   return 0;
+} catch (...) {
+  logging::log_current_exception(L"bus::unregister_listener");
+  return ERROR_OUTOFMEMORY;
 }
 
-bool bus::is_registered_listener(const char* channel, const char* id) {
+bool bus::is_registered_listener(const char* channel, const char* id) try {
   if (channel == nullptr) {
     logger_stream(level_error, L"bus::is_registered_listener") << L"channel is nullptr";
     return false;
@@ -136,6 +145,9 @@ bool bus::is_registered_listener(const char* channel, const char* id) {
   for (const auto& [pid, list] : listeners_) {
     if (std::find(list.begin(), list.end(), item) != list.end()) return true;
   }
+  return false;
+} catch (...) {
+  logging::log_current_exception(L"bus::is_registered_listener");
   return false;
 }
 
@@ -195,10 +207,11 @@ void bus::drop_process(std::uint32_t pid) {
   // A disconnect whose connect came before this bus observed the gateway
   // finds no count: that was the process's last known connection too.
   auto count = connections_.find(pid);
-  if (count == connections_.end() || --count->second == 0) {
-    if (count != connections_.end()) connections_.erase(count);
-    mark_departed_locked(pid);
-  }
+  // With another connection left the process is still there, and it will
+  // not publish its list again: its listeners stay.
+  if (count != connections_.end() && --count->second != 0) return;
+  if (count != connections_.end()) connections_.erase(count);
+  mark_departed_locked(pid);
   auto entry = listeners_.find(pid);
   if (entry == listeners_.end()) return;
   listener_list gone = std::move(entry->second);

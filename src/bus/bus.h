@@ -92,12 +92,14 @@ class bus final : public qm::observable<ibus_observer_base*, ibus>,
 
   std::uint32_t publish_locked();
   void on_connect(std::uint32_t pid);
+  // A connection to process `pid` ended; its listeners go with its last one.
   void drop_process(std::uint32_t pid);
   // Notes that process `pid` has no connection left that this bus heard of.
   void mark_departed_locked(std::uint32_t pid);
 
   // Declaration order is teardown order in reverse: the library outlives the
-  // messaging bus, which outlives the notifier and the table.
+  // messaging bus, which outlives the notifier and the table. The destructor
+  // stops the notifier before any of them goes.
   std::unique_ptr<library_record> library_;
   std::unique_ptr<parlo::bus, messaging_bus_deleter> messaging_bus_;
   std::uint32_t pid_;
