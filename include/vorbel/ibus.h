@@ -24,8 +24,9 @@ struct ibus_observer_base : IQmBaseInterface {};
 
 // Listener notifications. They run on the bus's own notification thread, one
 // at a time. The strings are valid only during the call. From inside a
-// notification an observer may call the bus's listener operations but must not
-// add or remove observers of the same bus.
+// notification an observer may call the bus's listener operations and the
+// registry (ivorbel) but must not add or remove observers of the same bus,
+// nor give back the bus's last use.
 struct ibus_observer : ibus_observer_base {
   // `pid` is the process in which the listener is registered.
   virtual void on_new_listener(std::uint32_t pid, const char* channel, const char* id) = 0;
@@ -43,17 +44,19 @@ inline constexpr std::size_t ibus_max_listener_name = 65536;
 struct ibus : ibus_base, qm::iobservable<ibus_observer_base*> {
   // The messaging library's bus object, on which the host does its messaging.
   virtual void* get_messaging_bus() = 0;
-  // 0, or 87 for a null argument, a channel or id longer than
+  // 0; 87 for a null argument, a channel or id longer than
   // ibus_max_listener_name, or a listener that would make this process's
   // table too large to publish in one message of the messaging library (about
-  // 16 MiB: the channel and id of each listener plus 32 bytes). Registering
-  // the same pair twice keeps two entries. Other processes learn of a
-  // registration shortly after it returns (see the architecture notes).
+  // 16 MiB: the channel and id of each listener plus 32 bytes); or 14
+  // (ERROR_OUTOFMEMORY) when memory ran out. Registering the same pair twice
+  // keeps two entries. Other processes learn of a registration shortly after
+  // it returns (see the architecture notes).
   virtual std::uint32_t register_listener(const char* channel, const char* id) = 0;
-  // Removes one entry equal to the pair. 0 (also when none was registered), or
-  // 87 for a null argument.
+  // Removes one entry equal to the pair. 0 (also when none was registered), 87
+  // for a null argument, or 14 when memory ran out.
   virtual std::uint32_t unregister_listener(const char* channel, const char* id) = 0;
-  // True when this process or any connected process has the listener.
+  // True when this process or any connected process has the listener (false,
+  // with a line in the log, when memory ran out).
   virtual bool is_registered_listener(const char* channel, const char* id) = 0;
 
  protected:

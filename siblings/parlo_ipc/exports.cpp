@@ -45,16 +45,21 @@ parlo::ipc::gateway* create_gateway(parlo::bus* bus, parlo::ipc::gateway::events
     ::SetLastError(ERROR_INVALID_PARAMETER);
     return nullptr;
   }
-  gateway_impl* created = new (std::nothrow) gateway_impl(bus, sink);
-  std::uint32_t err = created == nullptr ? ERROR_NOT_ENOUGH_MEMORY : created->init();
-  if (err == 0) {
-    try {
+  gateway_impl* created = nullptr;
+  std::uint32_t err = 0;
+  try {
+    created = new gateway_impl(bus, sink);
+    err = created->init();
+    if (err == 0) {
       live_gateways& gateways = live();
       std::lock_guard<srw_mutex> lock(gateways.mutex);
       gateways.list.push_back(created);
-    } catch (const std::bad_alloc&) {
-      err = ERROR_NOT_ENOUGH_MEMORY;
     }
+  } catch (const std::bad_alloc&) {
+    err = ERROR_NOT_ENOUGH_MEMORY;
+  } catch (const std::exception& e) {
+    logging::logger_stream(logging::level_error, L"parlo_ipc::create_gateway") << e.what();
+    err = ERROR_GEN_FAILURE;
   }
   if (err != 0) {
     logging::logger_stream(logging::level_error, L"parlo_ipc::create_gateway")

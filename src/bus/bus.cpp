@@ -67,15 +67,18 @@ bus::bus(const char* name)
       publisher_([this] { return send_table(); }) {}
 
 bus::~bus() {
-  // The publisher stops first: it encodes under the mutex and posts on the
-  // service channel.
+  // The publisher stops first: it takes the changes under the mutex and
+  // posts on the service channel.
   publisher_.stop();
+  // Then the notifier: the notification in progress may call back into this
+  // bus (an observer may register a listener), so it finishes while
+  // everything is in place; the queued ones are dropped.
+  notifier_.stop();
   // Then the service channel: until its subscription is released a delivery
-  // thread may still hand a message to this bus, which would lock a
-  // destroyed mutex.
+  // thread may still hand a message to this bus, which would use the table.
   service_channel_.reset();
-  // Then, by declaration order: the mutex and the table, the notifier (its
-  // queued tasks dropped), the messaging bus, the library, the observers.
+  // Then, by declaration order: the mutex and the table, the stopped
+  // notifier, the messaging bus, the library, the observers.
 }
 
 void* bus::GetInterface(GUID iid) {
@@ -94,7 +97,7 @@ void* bus::GetInterface(GUID iid) {
 
 void* bus::get_messaging_bus() { return messaging_bus_.get(); }
 
-std::uint32_t bus::register_listener(const char* channel, const char* id) {
+std::uint32_t bus::register_listener(const char* channel, const char* id) try {
   logging::trace_scope trace(L"bus::register_listener");
   if (channel == nullptr) {
     logger_stream(level_error, L"bus::register_listener") << L"channel is nullptr";
@@ -118,11 +121,22 @@ std::uint32_t bus::register_listener(const char* channel, const char* id) {
     std::unique_lock<srw_mutex> lock(mutex_);
     table_bytes = own_bytes_;
     if (table_bytes + adds <= comm::max_listeners_message_size) {
-      listener item{std::string(channel, channel_size), std::string(id, id_size)};
-      log_change_locked(/* added */ true, item);
-      post_new_listener(notifier_, observer_list_, pid_, item);
-      ++own_[std::move(item)];
+      // Everything that may run out of memory comes before the first
+      // change: the table, its notification and the publisher's list of
+      // changes must not disagree.
+      own_change change{/* added */ true,
+                        listener{std::string(channel, channel_size), std::string(id, id_size)}};
+      reserve_change_locked();
+      const auto entry = own_.try_emplace(change.item, 0).first;
+      try {
+        post_new_listener(notifier_, observer_list_, pid_, change.item);
+      } catch (...) {
+        if (entry->second == 0) own_.erase(entry);
+        throw;
+      }
+      ++entry->second;
       own_bytes_ += adds;
+      log_change_locked(std::move(change));
       lock.unlock();
       // Marked once the lock is free, so that the publisher does not wake
       // only to wait for it. A publication that took the change already
@@ -137,9 +151,12 @@ std::uint32_t bus::register_listener(const char* channel, const char* id) {
       << L"listener refused: the table would take more than " << comm::max_listeners_message_size
       << L" bytes in one message (" << table_bytes << L" now, " << adds << L" more)";
   return ERROR_INVALID_PARAMETER;
+} catch (...) {
+  logging::log_current_exception(L"bus::register_listener");
+  return ERROR_OUTOFMEMORY;
 }
 
-std::uint32_t bus::unregister_listener(const char* channel, const char* id) {
+std::uint32_t bus::unregister_listener(const char* channel, const char* id) try {
   logging::trace_scope trace(L"bus::unregister_listener");
   if (channel == nullptr) {
     logger_stream(level_error, L"bus::unregister_listener") << L"channel is nullptr";
@@ -149,29 +166,40 @@ std::uint32_t bus::unregister_listener(const char* channel, const char* id) {
     logger_stream(level_error, L"bus::unregister_listener") << L"listener_id is nullptr";
     return ERROR_INVALID_PARAMETER;
   }
+  own_change change{/* added */ false, listener{channel, id}};
   std::unique_lock<srw_mutex> lock(mutex_);
-  const listener item{channel, id};
-  auto found = own_.find(item);
+  auto found = own_.find(change.item);
   if (found == own_.end()) return 0;
-  own_bytes_ -= comm::listener_encoded_bound(item.channel.size(), item.id.size());
+  // As in register_listener: what may throw comes before the first change.
+  reserve_change_locked();
+  post_listener_removed(notifier_, observer_list_, pid_, change.item);
+  own_bytes_ -= comm::listener_encoded_bound(change.item.channel.size(), change.item.id.size());
   if (--found->second == 0) own_.erase(found);
-  log_change_locked(/* added */ false, item);
-  post_listener_removed(notifier_, observer_list_, pid_, item);
+  log_change_locked(std::move(change));
   lock.unlock();
   publisher_.mark_changed();
   return 0;
+} catch (...) {
+  logging::log_current_exception(L"bus::unregister_listener");
+  return ERROR_OUTOFMEMORY;
 }
 
-void bus::log_change_locked(bool added, const listener& item) {
+void bus::reserve_change_locked() {
+  if (own_changes_.size() < own_changes_.capacity()) return;
+  own_changes_.reserve(std::max<std::size_t>(64, 2 * own_changes_.capacity()));
+}
+
+void bus::log_change_locked(own_change change) noexcept {
   if (!keeps_changes_) return;
-  if (!own_changes_.empty() && own_changes_.back().added != added && own_changes_.back().item == item) {
+  if (!own_changes_.empty() && own_changes_.back().added != change.added &&
+      own_changes_.back().item == change.item) {
     own_changes_.pop_back();
     return;
   }
-  own_changes_.push_back(own_change{added, item});
+  own_changes_.push_back(std::move(change));  // room reserved: nothing is allocated
 }
 
-bool bus::is_registered_listener(const char* channel, const char* id) {
+bool bus::is_registered_listener(const char* channel, const char* id) try {
   if (channel == nullptr) {
     logger_stream(level_error, L"bus::is_registered_listener") << L"channel is nullptr";
     return false;
@@ -186,6 +214,9 @@ bool bus::is_registered_listener(const char* channel, const char* id) {
   for (const auto& [pid, list] : listeners_) {
     if (std::find(list.begin(), list.end(), item) != list.end()) return true;
   }
+  return false;
+} catch (...) {
+  logging::log_current_exception(L"bus::is_registered_listener");
   return false;
 }
 
@@ -268,10 +299,11 @@ void bus::drop_process(std::uint32_t pid) {
   // A disconnect whose connect came before this bus observed the gateway
   // finds no count: that was the process's last known connection too.
   auto count = connections_.find(pid);
-  if (count == connections_.end() || --count->second == 0) {
-    if (count != connections_.end()) connections_.erase(count);
-    mark_departed_locked(pid);
-  }
+  // With another connection left the process is still there, and it will
+  // not publish its list again: its listeners stay.
+  if (count != connections_.end() && --count->second != 0) return;
+  if (count != connections_.end()) connections_.erase(count);
+  mark_departed_locked(pid);
   auto entry = listeners_.find(pid);
   if (entry == listeners_.end()) return;
   listener_list gone = std::move(entry->second);

@@ -101,20 +101,29 @@ class bus final : public qm::observable<ibus_observer_base*, ibus>,
     void operator()(parlo::bus* b) const { destroy_bus(b); }
   };
 
-  // Appends a change for the publisher; under `mutex_`.
-  void log_change_locked(bool added, const listener& item);
+  struct own_change {
+    bool added;
+    listener item;
+  };
+  // Makes room for one more change, so that logging it cannot throw.
+  void reserve_change_locked();
+  // Appends a change for the publisher, or cancels the one before it (the
+  // same listener added, then removed); room was reserved.
+  void log_change_locked(own_change change) noexcept;
   // Nothing will publish this bus's table: changes are no longer kept.
   void stop_keeping_changes();
   // Takes the changes under `mutex_`, applies them to `published_`, encodes
   // and posts it; runs on the publisher's thread.
   publisher::outcome send_table();
   void on_connect(std::uint32_t pid);
+  // A connection to process `pid` ended; its listeners go with its last one.
   void drop_process(std::uint32_t pid);
   // Notes that process `pid` has no connection left that this bus heard of.
   void mark_departed_locked(std::uint32_t pid);
 
   // Declaration order is teardown order in reverse: the library outlives the
-  // messaging bus, which outlives the notifier and the table.
+  // messaging bus, which outlives the notifier and the table. The destructor
+  // stops the notifier before any of them goes.
   std::unique_ptr<library_record> library_;
   std::unique_ptr<parlo::bus, messaging_bus_deleter> messaging_bus_;
   std::uint32_t pid_;
@@ -128,10 +137,6 @@ class bus final : public qm::observable<ibus_observer_base*, ibus>,
   // publisher has not taken yet, in order. A removal right after the same
   // listener's addition cancels it in place, so a host that registers and
   // removes a listener again and again leaves no trail.
-  struct own_change {
-    bool added;
-    listener item;
-  };
   std::unordered_map<listener, std::size_t, listener_hash> own_;
   std::uint64_t own_bytes_ = comm::listeners_fixed_bound;
   std::vector<own_change> own_changes_;

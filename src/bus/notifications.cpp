@@ -43,8 +43,13 @@ void post_many(task_pool<0>& pool, bus_observer_list* list, std::uint32_t pid,
   // std::function needs a copyable callable: the list travels behind a
   // shared pointer instead of being copied.
   auto shared = std::make_shared<listener_list>(std::move(items));
-  pool.post([list, pid, shared, fn] {
-    for (const listener& item : *shared) fn(list, pid, item.channel.c_str(), item.id.c_str());
+  // A list of thousands would hold up the teardown of its bus: the task
+  // gives up once the pool is stopping, as the tasks behind it are dropped.
+  pool.post([&pool, list, pid, shared, fn] {
+    for (const listener& item : *shared) {
+      if (pool.stopping()) return;
+      fn(list, pid, item.channel.c_str(), item.id.c_str());
+    }
   });
 }
 

@@ -14,6 +14,22 @@
 
 #include <vorbel/qm_base.h>
 
+#include "logging/logger.h"
+
+// Holds a critical section for its scope, also when an exception leaves it.
+class critical_section_guard {
+ public:
+  explicit critical_section_guard(CRITICAL_SECTION& section) : section_(section) {
+    ::EnterCriticalSection(&section_);
+  }
+  critical_section_guard(const critical_section_guard&) = delete;
+  critical_section_guard& operator=(const critical_section_guard&) = delete;
+  ~critical_section_guard() { ::LeaveCriticalSection(&section_); }
+
+ private:
+  CRITICAL_SECTION& section_;
+};
+
 class qmFactoryBase {
  public:
   qmFactoryBase(const qmFactoryBase&) = delete;
@@ -58,13 +74,21 @@ class qmFactory final : public qmFactoryBase {
     if (!matches(object_name)) {
       return next == nullptr ? ERROR_NOT_FOUND : next->CreateObject(object_name, iid, out);
     }
-    ::EnterCriticalSection(&lock);
-    if (count == 0) instance = new T();
+    critical_section_guard guard(lock);
+    if (count == 0) {
+      // Without an instance nothing is counted: the caller, told 14, gives
+      // nothing back for it.
+      try {
+        instance = new T();
+      } catch (...) {
+        logging::log_current_exception(L"qmFactory::CreateObject");
+        return ERROR_OUTOFMEMORY;
+      }
+    }
     if (instance != nullptr) *out = instance->GetInterface(iid);
     // Counted even when no interface came out: the caller still pairs it with
     // a QmDestroyObject.
     ++count;
-    ::LeaveCriticalSection(&lock);
     return *out != nullptr ? ERROR_SUCCESS : ERROR_OUTOFMEMORY;
   }
 
@@ -73,14 +97,13 @@ class qmFactory final : public qmFactoryBase {
       if (next != nullptr) next->DestroyObject(object_name, object);
       return;
     }
-    ::EnterCriticalSection(&lock);
+    critical_section_guard guard(lock);
     // An unpaired destroy must not drive the count below zero, or the next
     // creation would find a non-zero count and hand out no instance.
     if (count > 0 && --count == 0) {
       delete instance;
       instance = nullptr;
     }
-    ::LeaveCriticalSection(&lock);
   }
 
   void* GetInterface(GUID iid) override {

@@ -80,85 +80,119 @@ void gateway_observer::apply_security(HANDLE pipe) {
   apply_pipe_security(pipe, pipes_security_descriptor_, ignored);
 }
 
-void gateway_observer::post_event(gateway_event event, HANDLE pipe, std::uint32_t pid,
-                                  std::uint32_t err) {
-  context_->pool.post(
-      make_event_notification(event, context_->observers, &context_->connections, pipe, pid, err));
+std::function<void()> gateway_observer::event_task(gateway_event event, HANDLE pipe,
+                                                   std::uint32_t pid, std::uint32_t err) {
+  return make_event_notification(event, context_->observers, &context_->connections, pipe, pid,
+                                 err);
 }
 
-void gateway_observer::on_listen(parlo::ipc::pipe_handle pipe, const char* name) {
+void gateway_observer::post_event(gateway_event event, HANDLE pipe, std::uint32_t pid,
+                                  std::uint32_t err) {
+  context_->pool.post(event_task(event, pipe, pid, err));
+}
+
+void gateway_observer::post_pair(std::function<void()> first, std::function<void()> second) {
+  context_->pool.post([first = std::move(first), second = std::move(second)] {
+    first();
+    second();
+  });
+}
+
+void gateway_observer::on_listen(parlo::ipc::pipe_handle pipe, const char* name) try {
   logging::trace_scope trace(L"gateway_observer::on_listen");
   logger_stream(level_info, L"gateway_observer::on_listen")
       << L"name=" << (name != nullptr ? name : "") << L" handle=" << pipe;
   apply_security(pipe);
   context_->pool.post(make_listen_notification(context_->observers, name != nullptr ? name : ""));
+} catch (...) {
+  logging::log_current_exception(L"gateway_observer::on_listen");
 }
 
-bool gateway_observer::on_local_connect(parlo::ipc::pipe_handle pipe, std::uint32_t pid) {
+bool gateway_observer::on_local_connect(parlo::ipc::pipe_handle pipe, std::uint32_t pid) try {
   logging::trace_scope trace(L"gateway_observer::on_local_connect");
   logger_stream(level_info, L"gateway_observer::on_local_connect")
       << L"pid=" << pid << L" handle=" << pipe;
   if (!is_allowed(pipe, pid)) return false;
   apply_security(pipe);
-  context_->pool.post(make_connection_insert(&context_->connections, pipe, pid));
-  post_event(gateway_event::local_connect, pipe, pid);
+  // The name is read now: the handle is the library's, closed soon after the
+  // disconnect.
+  post_pair(make_connection_insert(&context_->connections, pipe, get_pipe_name(pipe), pid),
+            event_task(gateway_event::local_connect, pipe, pid));
   return true;
+} catch (...) {
+  logging::log_current_exception(L"gateway_observer::on_local_connect");
+  return false;
 }
 
-void gateway_observer::on_local_disconnect(parlo::ipc::pipe_handle pipe) {
+void gateway_observer::on_local_disconnect(parlo::ipc::pipe_handle pipe) try {
   logging::trace_scope trace(L"gateway_observer::on_local_disconnect");
   logger_stream(level_info, L"gateway_observer::on_local_disconnect") << L"handle=" << pipe;
   if (pipe == nullptr) return;
   // The notification first: it still reads the connection's name and pid.
-  post_event(gateway_event::local_disconnect, pipe);
-  context_->pool.post(make_connection_removal(&context_->connections, pipe));
+  post_pair(event_task(gateway_event::local_disconnect, pipe),
+            make_connection_removal(&context_->connections, pipe));
+} catch (...) {
+  logging::log_current_exception(L"gateway_observer::on_local_disconnect");
 }
 
-void gateway_observer::on_local_start_communication(parlo::ipc::pipe_handle pipe) {
+void gateway_observer::on_local_start_communication(parlo::ipc::pipe_handle pipe) try {
   logging::trace_scope trace(L"gateway_observer::on_local_start_communication");
   logger_stream(level_info, L"gateway_observer::on_local_start_communication") << L"handle=" << pipe;
   if (pipe == nullptr) return;
   post_event(gateway_event::local_start_communication, pipe);
+} catch (...) {
+  logging::log_current_exception(L"gateway_observer::on_local_start_communication");
 }
 
-void gateway_observer::on_local_error(parlo::ipc::pipe_handle pipe, std::uint32_t err) {
+void gateway_observer::on_local_error(parlo::ipc::pipe_handle pipe, std::uint32_t err) try {
   logging::trace_scope trace(L"gateway_observer::on_local_error");
   logger_stream(level_info, L"gateway_observer::on_local_error")
       << L"handle=" << pipe << L" err=" << err;
   if (pipe == nullptr) return;
   post_event(gateway_event::local_error, pipe, 0, err);
+} catch (...) {
+  logging::log_current_exception(L"gateway_observer::on_local_error");
 }
 
-bool gateway_observer::on_remote_connect(parlo::ipc::pipe_handle pipe, std::uint32_t pid) {
+bool gateway_observer::on_remote_connect(parlo::ipc::pipe_handle pipe, std::uint32_t pid) try {
   logging::trace_scope trace(L"gateway_observer::on_remote_connect");
   logger_stream(level_info, L"gateway_observer::on_remote_connect")
       << L"pid=" << pid << L" handle=" << pipe;
-  context_->pool.post(make_connection_insert(&context_->connections, pipe, pid));
-  post_event(gateway_event::remote_connect, pipe, pid);
+  post_pair(make_connection_insert(&context_->connections, pipe, get_pipe_name(pipe), pid),
+            event_task(gateway_event::remote_connect, pipe, pid));
   return true;
+} catch (...) {
+  logging::log_current_exception(L"gateway_observer::on_remote_connect");
+  return false;
 }
 
-void gateway_observer::on_remote_disconnect(parlo::ipc::pipe_handle pipe) {
+void gateway_observer::on_remote_disconnect(parlo::ipc::pipe_handle pipe) try {
   logging::trace_scope trace(L"gateway_observer::on_remote_disconnect");
   logger_stream(level_info, L"gateway_observer::on_remote_disconnect") << L"handle=" << pipe;
   if (pipe == nullptr) return;
-  post_event(gateway_event::remote_disconnect, pipe);
-  context_->pool.post(make_connection_removal(&context_->connections, pipe));
+  post_pair(event_task(gateway_event::remote_disconnect, pipe),
+            make_connection_removal(&context_->connections, pipe));
+} catch (...) {
+  logging::log_current_exception(L"gateway_observer::on_remote_disconnect");
 }
 
-void gateway_observer::on_remote_start_communication(parlo::ipc::pipe_handle pipe) {
+void gateway_observer::on_remote_start_communication(parlo::ipc::pipe_handle pipe) try {
   logging::trace_scope trace(L"gateway_observer::on_remote_start_communication");
   logger_stream(level_info, L"gateway_observer::on_remote_start_communication") << L"handle=" << pipe;
   if (pipe == nullptr) return;
   post_event(gateway_event::remote_start_communication, pipe);
+} catch (...) {
+  logging::log_current_exception(L"gateway_observer::on_remote_start_communication");
 }
 
-void gateway_observer::on_remote_error(parlo::ipc::pipe_handle pipe, std::uint32_t err) {
+void gateway_observer::on_remote_error(parlo::ipc::pipe_handle pipe, std::uint32_t err) try {
   logging::trace_scope trace(L"gateway_observer::on_remote_error");
   logger_stream(level_info, L"gateway_observer::on_remote_error")
       << L"handle=" << pipe << L" err=" << err;
   if (pipe == nullptr) return;
   post_event(gateway_event::remote_error, pipe, 0, err);
+} catch (...) {
+  logging::log_current_exception(L"gateway_observer::on_remote_error");
 }
 
 bool gateway_observer::is_allowed(HANDLE pipe, std::uint32_t pid) {

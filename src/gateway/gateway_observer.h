@@ -14,6 +14,7 @@
 #include <windows.h>
 
 #include <cstdint>
+#include <functional>
 #include <map>
 #include <memory>
 #include <optional>
@@ -86,7 +87,14 @@ class gateway_observer final : public parlo::ipc::gateway::events {
 
   bool is_allowed(HANDLE pipe, std::uint32_t pid);
   void apply_security(HANDLE pipe);
+  std::function<void()> event_task(gateway_event event, HANDLE pipe, std::uint32_t pid = 0,
+                                   std::uint32_t err = 0);
   void post_event(gateway_event event, HANDLE pipe, std::uint32_t pid = 0, std::uint32_t err = 0);
+  // Posts both as one task, or neither when memory runs out: a connection's
+  // insert without its notification, or its notification without its
+  // removal, would leave the cache out of step with the library, and a later
+  // pipe given the same handle value would be named after this one.
+  void post_pair(std::function<void()> first, std::function<void()> second);
 
   std::unique_ptr<notify_context> context_;
   signature_checker signature_checker_;

@@ -92,8 +92,8 @@ struct task {
 }  // namespace
 
 std::function<void()> make_connection_insert(connections_cache* cache, HANDLE pipe,
-                                             std::uint32_t pid) {
-  return [cache, pipe, pid] { cache->insert(pipe, get_pipe_name(pipe), pid); };
+                                             std::string name, std::uint32_t pid) {
+  return [cache, pipe, name = std::move(name), pid] { cache->insert(pipe, name, pid); };
 }
 
 std::function<void()> make_connection_removal(connections_cache* cache, HANDLE pipe) {

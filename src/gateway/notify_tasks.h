@@ -30,9 +30,12 @@ enum class gateway_event {
   remote_error,
 };
 
-// Reads the pipe's name and caches (handle, name, pid).
+// Caches (handle, name, pid). The name is read from the handle when the
+// connect event arrives (get_pipe_name): by the time the task runs, the IPC
+// library may have closed the handle and the system given its value to
+// another pipe.
 std::function<void()> make_connection_insert(connections_cache* cache, HANDLE pipe,
-                                             std::uint32_t pid);
+                                             std::string name, std::uint32_t pid);
 std::function<void()> make_connection_removal(connections_cache* cache, HANDLE pipe);
 
 // Calls on_listen(name) on every observer.

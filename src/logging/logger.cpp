@@ -4,6 +4,7 @@
 #include <mmsystem.h>
 
 #include <cwchar>
+#include <exception>
 
 #include "logging/log_dll.h"
 #include "platform/win_api.h"
@@ -88,6 +89,16 @@ logger_stream& logger_stream::operator<<(const void* pointer) {
   static_cast<std::wostream&>(*this) << static_cast<unsigned long long>(
       reinterpret_cast<std::uintptr_t>(pointer));
   return *this;
+}
+
+void log_current_exception(const wchar_t* function) noexcept {
+  try {
+    throw;
+  } catch (const std::exception& e) {
+    logger_stream(level_error, function) << L"failed: " << e.what();
+  } catch (...) {
+    logger_stream(level_error, function) << L"failed: unknown exception";
+  }
 }
 
 trace_scope::trace_scope(const wchar_t* name) : start(::timeGetTime()) {

@@ -66,6 +66,11 @@ class logger_stream : public std::wostringstream {
   const wchar_t* function_;
 };
 
+// Inside a catch block: writes the level_error line "failed: " and the text
+// of the exception in flight under `function`. For the entries that hosts
+// and sibling libraries call, which let no exception out.
+void log_current_exception(const wchar_t* function) noexcept;
+
 // Entry and exit lines of a traced operation; place it first in the
 // operation. The exit line carries the elapsed milliseconds and is written on
 // every way out, exceptions included.

@@ -46,16 +46,9 @@ class CallbackList {
   // this thread (that would deadlock) or for lack of resources.
   bool add(T observer, std::uintptr_t context) {
     if (!admissible(observer, L"CallbackList::add")) return false;
-    std::unique_ptr<callback_entry> entry;
     try {
-      entry = std::make_unique<callback_entry>(observer, context);
-    } catch (const std::exception& e) {
-      logging::logger_stream(logging::level_error, L"CallbackList::add")
-          << "cannot add an observer: " << e.what();
-      return false;
-    }
-    bool found = false;
-    {
+      auto entry = std::make_unique<callback_entry>(observer, context);
+      bool found = false;
       rw_write_guard guard(lock_);
       for (const auto& existing : entries_) {
         rw_read_guard entry_guard(existing->lock);
@@ -65,8 +58,12 @@ class CallbackList {
         }
       }
       if (!found) entries_.push_back(std::move(entry));
+      return !found;
+    } catch (const std::exception& e) {
+      logging::logger_stream(logging::level_error, L"CallbackList::add")
+          << "cannot add an observer: " << e.what();
+      return false;
     }
-    return !found;
   }
 
   // 0 when the first active entry with this observer and this context was

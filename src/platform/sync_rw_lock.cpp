@@ -2,6 +2,7 @@
 
 #include <cstdio>
 #include <cstdlib>
+#include <new>
 #include <string>
 
 #include "logging/logger.h"
@@ -67,7 +68,7 @@ void CSyncRWLock::LockRead(std::uint32_t thread_id) {
     } else if (active_writer_ != 0 || waiting_writers_ != 0) {
       block = true;
     } else {
-      readers_[t] = 1;
+      add_reader_or_throw_locked(t);
       ++active_readers_;
     }
   } else {
@@ -77,7 +78,7 @@ void CSyncRWLock::LockRead(std::uint32_t thread_id) {
     } else if (waiting_writers_ != 0) {
       block = true;
     } else {
-      readers_[t] = 1;
+      add_reader_or_throw_locked(t);
       ++active_readers_;
     }
   }
@@ -89,8 +90,39 @@ void CSyncRWLock::LockRead(std::uint32_t thread_id) {
   ::LeaveCriticalSection(&section_);
   wait_on(reader_semaphore_.get(), L"CSyncRWLock::LockRead", t);
   ::EnterCriticalSection(&section_);
-  readers_[t] = 1;  // the releasing writer already counted us in active_readers_
+  // The releasing writer already counted us in active_readers_: without a
+  // record of ours, that place is given back before the failure leaves.
+  if (!add_reader_locked(t)) {
+    leave_reader_locked();
+    throw std::bad_alloc();
+  }
   ::LeaveCriticalSection(&section_);
+}
+
+bool CSyncRWLock::add_reader_locked(std::uint32_t t) {
+  try {
+    readers_.emplace(t, 1);
+    return true;
+  } catch (const std::bad_alloc&) {
+    return false;
+  }
+}
+
+void CSyncRWLock::add_reader_or_throw_locked(std::uint32_t t) {
+  if (add_reader_locked(t)) return;
+  ::LeaveCriticalSection(&section_);
+  throw std::bad_alloc();
+}
+
+void CSyncRWLock::leave_reader_locked() {
+  --active_readers_;
+  const bool wake_writer = active_readers_ == 0 && waiting_writers_ != 0;
+  if (wake_writer) {
+    --waiting_writers_;
+    active_writer_ = 1;
+  }
+  ::LeaveCriticalSection(&section_);
+  if (wake_writer) release(writer_semaphore_.get(), 1, L"CSyncRWLock::UnlockRead");
 }
 
 void CSyncRWLock::UnlockRead(std::uint32_t thread_id) {
@@ -120,14 +152,7 @@ void CSyncRWLock::UnlockRead(std::uint32_t thread_id) {
     return;
   }
   readers_.erase(found);
-  --active_readers_;
-  const bool wake_writer = active_readers_ == 0 && waiting_writers_ != 0;
-  if (wake_writer) {
-    --waiting_writers_;
-    active_writer_ = 1;
-  }
-  ::LeaveCriticalSection(&section_);
-  if (wake_writer) release(writer_semaphore_.get(), 1, L"CSyncRWLock::UnlockRead");
+  leave_reader_locked();
 }
 
 void CSyncRWLock::LockWrite(std::uint32_t thread_id) {

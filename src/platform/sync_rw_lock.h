@@ -39,6 +39,8 @@ class CSyncRWLock final : public ISyncRWLock {
   CSyncRWLock& operator=(const CSyncRWLock&) = delete;
   ~CSyncRWLock();
 
+  // Throws std::bad_alloc, holding nothing, when there is no memory to
+  // record a new reading thread.
   void LockRead(std::uint32_t thread_id) override;
   void UnlockRead(std::uint32_t thread_id) override;
   void LockWrite(std::uint32_t thread_id) override;
@@ -63,6 +65,13 @@ class CSyncRWLock final : public ISyncRWLock {
  private:
   // Clears the writer and hands the lock on; leaves the critical section.
   void release_writer_locked();
+  // Records a new reading thread; false when there is no memory for it.
+  bool add_reader_locked(std::uint32_t t);
+  // The same, but leaves the critical section and throws std::bad_alloc.
+  void add_reader_or_throw_locked(std::uint32_t t);
+  // One reader fewer; wakes a waiting writer after the last. Leaves the
+  // critical section.
+  void leave_reader_locked();
 
   mutable CRITICAL_SECTION section_;
   winapi::unique_handle reader_semaphore_;

@@ -2,8 +2,9 @@
 //
 // The owner constructs and destroys the pool; any thread may post. Tasks run
 // on the worker only, one at a time, in the order in which posts took the
-// lock. Destruction lets the running task finish and drops the queued ones
-// unrun, so a task must not rely on a later one to clean up after it.
+// lock. Stopping (or destruction) lets the running task finish and drops the
+// queued ones unrun, so a task must not rely on a later one to clean up after
+// it.
 //
 // The queue's lock and the worker's wake-up are the system's slim ones
 // (platform/srw_sync.h): every listener notification is handed over here.
@@ -39,18 +40,24 @@ class task_pool {
   task_pool(const task_pool&) = delete;
   task_pool& operator=(const task_pool&) = delete;
 
-  ~task_pool() {
+  ~task_pool() { stop(); }
+
+  // Lets the running task finish and drops the queued ones; tasks posted
+  // afterwards never run. The owner stops its pool before it takes apart
+  // anything a task may reach. Idempotent.
+  void stop() {
     if (on_worker_thread()) {
       // The worker cannot wait for itself to end.
-      std::fputs("task_pool: fatal: destroyed from a task on its own worker\n", stderr);
+      std::fputs("task_pool: fatal: stopped from a task on its own worker\n", stderr);
       std::abort();
     }
     {
       std::lock_guard<srw_mutex> lock(lock_);
       running_ = false;
+      queue_.clear();  // the queued tasks are dropped unrun
       wake_.notify_all();
     }
-    worker_.join();
+    if (worker_.joinable()) worker_.join();
   }
 
   void post(std::function<void()> task) {
@@ -62,8 +69,8 @@ class task_pool {
   // True on the worker thread; pool-only code asserts it.
   bool on_worker_thread() const { return std::this_thread::get_id() == worker_.get_id(); }
 
-  // True once destruction has begun: a long task may poll it to give up
-  // early, since the tasks behind it will not run anyway.
+  // True once stop (or destruction) has begun: a long task may poll it to
+  // give up early, since the tasks behind it will not run anyway.
   bool stopping() const { return !running_; }
 
  private:

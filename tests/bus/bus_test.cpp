@@ -276,8 +276,9 @@ TEST_F(bus_test, malformed_listeners_messages_are_dropped_with_the_exact_lines) 
   EXPECT_EQ(4u, lines[0].level);
 }
 
-// A process may be connected twice; its lists count until its last
-// connection ends, and a list still on its way after that cannot bring it back.
+// A process may be connected twice; it keeps its listeners, and its lists
+// count, until its last connection ends, and a list still on its way after
+// that cannot bring it back.
 TEST_F(bus_test, connect_publishes_and_asks_and_the_last_disconnect_drops_the_process_for_good) {
   b.register_listener("own", "1");
   settle();
@@ -298,9 +299,10 @@ TEST_F(bus_test, connect_publishes_and_asks_and_the_last_disconnect_drops_the_pr
   settle();
   b.on_local_disconnect("\\pipe", own);  // this process's own id is never dropped
   b.on_local_disconnect("\\pipe", other_pid);
+  EXPECT_TRUE(settle().empty()) << "the process is still connected once: its listeners stay";
   publish_as(other_pid, {{"a", "2"}});
-  EXPECT_EQ((notifications{removed(other_pid, "a", "1"), removed(other_pid, "b", "2"), removed(other_pid, "c", "3"),
-                           added(other_pid, "a", "2")}), settle());
+  EXPECT_EQ((notifications{added(other_pid, "a", "2"), removed(other_pid, "a", "1"), removed(other_pid, "b", "2"),
+                           removed(other_pid, "c", "3")}), settle());
 
   b.on_remote_disconnect("\\other", other_pid);
   publish_as(other_pid, {{"a", "3"}});

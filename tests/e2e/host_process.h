@@ -7,6 +7,8 @@
 
 #include <windows.h>
 
+#include <gtest/gtest.h>
+
 #include <algorithm>
 #include <chrono>
 #include <cstdio>
@@ -36,6 +38,12 @@ using table = std::map<std::uint32_t, items>;  // by pid
 using pipes = std::vector<std::pair<std::string, std::uint32_t>>;  // name, security level
 
 inline DWORD own() { return ::GetCurrentProcessId(); }
+
+// How long a wait across processes may take before it counts as failed. On
+// a loaded 2-core machine a process start, an admission and a client's
+// retry after its backoff take seconds, not milliseconds; a wait ends as
+// soon as its condition holds, so only a failure pays for the margin.
+inline constexpr std::chrono::milliseconds patience = 30s;
 
 // A whole number from the environment, or `fallback`: long runs are made by
 // hand with a larger figure.
@@ -106,7 +114,7 @@ class host_process {
 
   // Waits for a whole line that begins with `start` and returns it; empty
   // when none came in time.
-  std::string wait_line(const std::string& start, std::chrono::milliseconds timeout = 10s) const {
+  std::string wait_line(const std::string& start, std::chrono::milliseconds timeout = patience) const {
     std::string line;
     test_support::wait_until([&] {
       const std::string text = output();
@@ -117,8 +125,10 @@ class host_process {
     }, timeout);
     return line;
   }
-  bool wait_for(const std::string& exact, std::chrono::milliseconds timeout = 10s) const {
-    return wait_line(exact + "\n", timeout) == exact;
+  ::testing::AssertionResult wait_for(const std::string& exact, std::chrono::milliseconds timeout = patience) const {
+    if (wait_line(exact + "\n", timeout) == exact) return ::testing::AssertionSuccess();
+    return ::testing::AssertionFailure() << "waited " << timeout.count() << " ms" << " for the line \"" << exact
+                                         << "\" from " << out_ << "; it printed instead:" << output();
   }
   // Everything printed so far, each line after a newline.
   std::string output() const {
@@ -227,18 +237,27 @@ class table_observer final : public ibus_observer {
 
   // Polls rather than being woken by every notification: a waiter woken
   // 100,000 times would fight the notifier thread for the lock.
-  bool wait(const std::function<bool(const table&)>& condition, std::chrono::milliseconds timeout = 10s) {
-    return test_support::wait_until([&] {
-      std::lock_guard<srw_mutex> lock(mutex_);
-      return condition(table_);
-    }, timeout);
+  // A failure says what was waited for and the table seen at the end.
+  ::testing::AssertionResult wait(const std::function<bool(const table&)>& condition,
+                                  std::chrono::milliseconds timeout = patience,
+                                  const std::string& what = "the table to meet the test's condition") {
+    if (test_support::wait_until([&] {
+          std::lock_guard<srw_mutex> lock(mutex_);
+          return condition(table_);
+        }, timeout)) {
+      return ::testing::AssertionSuccess();
+    }
+    return ::testing::AssertionFailure() << "waited " << timeout.count() << " ms" << " for " << what
+                                         << "; the observed table was " << ::testing::PrintToString(current());
   }
-  bool wait_has(std::uint32_t pid, const std::string& id, bool present = true,
-                std::chrono::milliseconds timeout = 10s) {
-    return wait([&](const table& t) { return (t.count(pid) != 0 && t.at(pid).count(id) != 0) == present; }, timeout);
+  ::testing::AssertionResult wait_has(std::uint32_t pid, const std::string& id, bool present = true,
+                                      std::chrono::milliseconds timeout = patience) {
+    return wait([&](const table& t) { return (t.count(pid) != 0 && t.at(pid).count(id) != 0) == present; }, timeout,
+                "pid " + std::to_string(pid) + (present ? " to list " : " to no longer list ") + id);
   }
-  bool wait_gone(std::uint32_t pid, std::chrono::milliseconds timeout = 10s) {
-    return wait([&](const table& t) { return t.count(pid) == 0; }, timeout);
+  ::testing::AssertionResult wait_gone(std::uint32_t pid, std::chrono::milliseconds timeout = patience) {
+    return wait([&](const table& t) { return t.count(pid) == 0; }, timeout,
+                "every listener of pid " + std::to_string(pid) + " to be gone");
   }
 
  private:

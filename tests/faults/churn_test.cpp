@@ -74,7 +74,7 @@ TEST_F(churn_test, connect_kill_cycles_give_back_every_handle_and_the_memory) {
   // No peer, no trust entry, no connection: what the process holds at rest.
   auto settle = [&] {
     return wait_until([&] { return server.events().trusted_process_count() == 0 && server.connection_count() == 0; },
-                      10s);
+                      patience);
   };
 
   // The thread runtime makes an event for each of its own locks the first

@@ -59,27 +59,51 @@ TEST(pipe_security_map, the_prefix_goes_in_any_letter_case_and_a_name_too_short_
             make_pipe_security_map({{"\\\\.\\PiPe\\mixed", 1}, {"\\\\.\\PIP", 0}}));
 }
 
-TEST_F(gateway_observer_test, admission_follows_the_peers_trust_and_the_pipes_level) {
+// Every trust against every level, decided first and then from the cache:
+// each row's image runs twice, one process asking first on level 0, the
+// other first on level 1; each then asks again on the same level and on the
+// other one, both answered from the cache. A cached answer must be the
+// first answer: a low-trust peer admitted on level 0 from the cache would
+// open level 0 pipes to every validly signed process.
+TEST_F(gateway_observer_test, admission_follows_trust_and_level_first_and_cached) {
   if (!get_current_signature()) GTEST_SKIP() << "the unsigned build refuses everyone";
-  child_process ours(image_path(L"child_a")), other(image_path(L"child_b"));
-  child_process unsigned_peer(image_path(L"child_unsigned")), tampered(image_path(L"child_tampered"));
-  ASSERT_TRUE(ours.running() && other.running() && unsigned_peer.running() && tampered.running());
-
-  EXPECT_TRUE(connect(level0, ours.pid()));
-  EXPECT_TRUE(connect(level1, ours.pid()));
+  struct row {
+    const wchar_t* image;
+    const wchar_t* trust;  // as the cache line names it
+    bool level0, level1;   // admitted?
+  };
+  const row rows[] = {
+      {L"child_a", L"high_trust", true, true},
+      {L"child_b", L"low_trust", false, true},
+      {L"child_unsigned", L"untrusted", false, false},
+      {L"child_tampered", L"untrusted", false, false},
+  };
+  const winapi::unique_handle* pipes[] = {&level0, &level1};
+  for (const row& r : rows) {
+    const bool expected[] = {r.level0, r.level1};
+    for (int first : {0, 1}) {
+      child_process peer(image_path(r.image));
+      ASSERT_TRUE(peer.running()) << image_path(r.image).c_str();
+      const std::wstring cached_line = std::wstring(L"found it in cache, trust=") + r.trust;
+      const std::size_t cached_before = find_lines(L"gateway_observer::is_allowed_process", cached_line).size();
+      const std::size_t denials_before = denials(peer.pid());  // Wine reuses pids
+      const int order[] = {first, first, 1 - first};  // first decision, then two from the cache
+      std::size_t refused = 0;
+      for (int step = 0; step < 3; ++step) {
+        const int level = order[step];
+        EXPECT_EQ(expected[level], connect(*pipes[level], peer.pid()))
+            << r.image << " on level " << level << (step == 0 ? " (first decision)" : " (cached decision)");
+        refused += expected[level] ? 0 : 1;
+      }
+      EXPECT_EQ(cached_before + 2, find_lines(L"gateway_observer::is_allowed_process", cached_line).size())
+          << r.image << ": the second and third decisions come from the cache";
+      EXPECT_EQ(denials_before + refused, denials(peer.pid())) << r.image << ": one DENY line per refusal";
+    }
+  }
   unique_local_sid holder;
   EXPECT_EQ(6u, security_test::dacl_of(level0.get(), holder)->AceCount) << "the admitted get the component's DACL";
-  EXPECT_FALSE(connect(level0, other.pid()));
-  EXPECT_TRUE(connect(level1, other.pid()));
-  EXPECT_EQ(1u, denials(other.pid()));
-  EXPECT_TRUE(has_line(L"gateway_observer::is_allowed_process", L"found it in cache, trust=low_trust"));
-  for (const child_process* peer : {&unsigned_peer, &tampered}) {
-    EXPECT_FALSE(connect(level1, peer->pid()));
-    EXPECT_FALSE(connect(level0, peer->pid()));
-    EXPECT_EQ(2u, denials(peer->pid()));
-  }
-  EXPECT_EQ(2u, find_lines(L"gateway_observer::is_allowed_process", L"found it in cache, trust=untrusted").size());
 
+  child_process ours(image_path(L"child_a"));
   EXPECT_FALSE(connect(unlisted, ours.pid()));
   EXPECT_TRUE(has_line(L"gateway_observer::is_allowed",
                        L"DENY pid=" + std::to_wstring(ours.pid()) + L" reason: can't find the pipe in config"));

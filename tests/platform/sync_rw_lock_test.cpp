@@ -84,3 +84,21 @@ TEST_F(rw_lock_test, WritersGoFirstReadersNestAndAWriterLeavesAfterItsLastUnlock
   EXPECT_EQ(lock.GetCounters().active_readers, 2u);
   EXPECT_TRUE(done(unread(c)) && done(unread(d)));
 }
+
+// A waiting writer is woken by the last reader to leave, not by the first:
+// readers a and c hold the lock, b waits to write; a leaves and b still waits
+// (the bookkeeping shows no writer yet), then c leaves and b goes in.
+TEST_F(rw_lock_test, AWaitingWriterWaitsForEveryReaderToLeave) {
+  ASSERT_TRUE(done(read(a)) && done(read(c)));
+  const auto w = write(b);
+  ASSERT_TRUE(blocked(0, 1));
+  ASSERT_TRUE(done(unread(a)));
+  const auto after_first = lock.GetCounters();
+  EXPECT_EQ(after_first.active_writer, 0u) << "a writer was let in while c still reads";
+  EXPECT_EQ(after_first.waiting_writers, 1u);
+  EXPECT_EQ(after_first.active_readers, 1u);
+  EXPECT_FALSE(done(w, 200ms)) << "b writes while c still reads";
+  ASSERT_TRUE(done(unread(c)));
+  EXPECT_TRUE(done(w)) << "b still waits after the last reader left";
+  EXPECT_TRUE(done(unwrite(b)));
+}

@@ -160,7 +160,8 @@ std::uint32_t service_channel::publish_listeners(const std::uint8_t* bytes, std:
   return posted;
 }
 
-void service_channel::on_message(parlo::message* message) {
+// Runs on the messaging library's delivery thread: nothing may escape it.
+void service_channel::on_message(parlo::message* message) try {
   const std::uint32_t id = message->message_id();
   if (id == static_cast<std::uint32_t>(service_channel_messages_id::publish_listeners)) {
     observer_->on_listeners_requested();
@@ -185,14 +186,14 @@ void service_channel::on_message(parlo::message* message) {
   // This process's own publication comes back on its own subscription; it is
   // dropped before the list is built.
   if (pid == own_pid_) return;
-  // This runs on the messaging library's delivery thread: nothing may
-  // escape it, or the process ends.
   try {
     observer_->on_remote_listeners(pid, read_listeners(data));
   } catch (const std::exception& e) {
     logger_stream(level_error, L"comm::service_channel::on_message")
         << L"listeners message of pid=" << pid << L" dropped: " << e.what();
   }
+} catch (...) {
+  logging::log_current_exception(L"comm::service_channel::on_message");
 }
 
 }  // namespace comm
