@@ -133,31 +133,6 @@ TEST_F(bus_test, duplicates_are_kept_and_removed_one_at_a_time_and_the_last_tabl
   EXPECT_EQ(tables.size(), published.size()) << "no request was posted";
 }
 
-// A burst fills the table in a few publications, each a table the process
-// had, whose bytes stay within a few times the last one's.
-TEST_F(bus_test, a_burst_is_published_in_few_whole_tables_ending_with_the_last) {
-  constexpr std::size_t n = 2000;
-  listener_list all;
-  for (std::size_t i = 0; i < n; ++i) {
-    char id[16];
-    std::snprintf(id, sizeof id, "id-%06zu", i);  // registered in listener order
-    all.push_back({"burst", id});
-    ASSERT_EQ(0u, b.register_listener("burst", id));
-  }
-  EXPECT_EQ(n, settle().size());
-  const std::vector<listener_list> tables = own_tables();
-  ASSERT_FALSE(tables.empty());
-  std::size_t last = 0, bytes = 0;
-  for (const listener_list& table : tables) {
-    EXPECT_TRUE(table.size() >= last && std::equal(table.begin(), table.end(), all.begin()))
-        << "each table is the first " << table.size() << " registrations, after the " << last << " of the one before";
-    last = table.size();
-    bytes += comm::encode_listeners(own, table).size();
-  }
-  EXPECT_EQ(all, tables.back());
-  EXPECT_LE(bytes, 8 * comm::encode_listeners(own, all).size()) << tables.size() << " publications";
-}
-
 // A peer that asks again and again is answered at the publisher's pace, not
 // once per request: a table of 10,000 listeners (520 KB) asked for every
 // millisecond for half a second goes out a handful of times.
