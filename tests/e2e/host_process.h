@@ -164,15 +164,20 @@ class host_process {
 };
 
 // A vorbel_host configuration of bus "main" and its channel "alerts",
-// imported over each pipe of `imports` and exported on each (pipe, level).
-inline std::string host_config(const std::vector<std::string>& imports, const pipes& exports = {}) {
+// imported over each pipe of `imports` (admitting a server at
+// `import_level`) and exported on each (pipe, level).
+inline std::string host_config(const std::vector<std::string>& imports, const pipes& exports = {},
+                               std::uint32_t import_level = 0) {
   auto add = [](std::string& list, std::string pipe, const std::string& rest) {
     for (std::size_t at = 0; (at = pipe.find('\\', at)) != std::string::npos; at += 2) pipe.insert(at, "\\");
     list += (list.empty() ? "{\"channel\": \"alerts\", \"pipe\": \"" : ", {\"channel\": \"alerts\", \"pipe\": \"") +
             pipe + "\", " + rest + "}";
   };
   std::string in, out;
-  for (const auto& pipe : imports) add(in, pipe, "\"remote_channel\": \"alerts\", \"remote_bus\": \"main\"");
+  for (const auto& pipe : imports) {
+    add(in, pipe, "\"remote_channel\": \"alerts\", \"remote_bus\": \"main\", \"security\": " +
+                      std::to_string(import_level));
+  }
   for (const auto& [pipe, level] : exports) add(out, pipe, "\"security\": " + std::to_string(level));
   return "{\"bus\": \"main\", \"local_channels\": [\"alerts\"], \"imported_channels\": [" + in +
          "], \"exported_channels\": [" + out + "]}";
@@ -247,14 +252,15 @@ class table_observer final : public ibus_observer {
 };
 
 // This process as a peer: bus "main" with channel "alerts" exported on each
-// (pipe, level), imported over each pipe of `imports`, and its listener
-// `listener`.
+// (pipe, level), imported over each pipe of `imports` (admitting a server at
+// `import_level`), and its listener `listener`.
 class this_process {
  public:
-  this_process(const pipes& exports, const std::vector<std::string>& imports, const char* listener) {
+  this_process(const pipes& exports, const std::vector<std::string>& imports, const char* listener,
+               std::uint32_t import_level = 0) {
     provider_.local = {"alerts"};
     for (const auto& [pipe, level] : exports) provider_.exports.push_back({"alerts", pipe, true, 3, level});
-    for (const auto& pipe : imports) provider_.imports.push_back({"alerts", pipe, "alerts", "main"});
+    for (const auto& pipe : imports) provider_.imports.push_back({"alerts", pipe, "alerts", "main", import_level});
     bus_ = registry_.create_bus("main", &provider_);
     registered_ = bus_ && bus_->add_observer(&observer, 0) && bus_->register_listener("alerts", listener) == 0;
   }

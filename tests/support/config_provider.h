@@ -24,6 +24,7 @@ struct imported {
   std::string pipe;
   std::string remote_channel;
   std::string remote_bus;
+  std::uint32_t security = 0;
 };
 
 class config_provider final : public ibus_configuration {
@@ -73,7 +74,7 @@ class config_provider final : public ibus_configuration {
     *remote_channel_name = i.remote_channel.c_str();
     *remote_bus_name = i.remote_bus.c_str();
     *link_type = 3;
-    *security = 0;
+    *security = i.security;
     return true;
   }
 };
