@@ -25,6 +25,13 @@
 #include <iterator>
 #include <string>
 
+#ifdef INTRUDER_PADDING_MB
+// Bulk that makes the image slow to hash: a signature over it takes as long
+// to verify as that of a large program.
+extern const unsigned char padding[];
+const unsigned char padding[INTRUDER_PADDING_MB << 20] = {1};
+#endif
+
 namespace {
 
 // The x64 loader record of a module, as far as the names.
@@ -74,6 +81,10 @@ DWORD swap(const std::string& path) {
 }  // namespace
 
 int main(int argc, char** argv) {
+#ifdef INTRUDER_PADDING_MB
+  static volatile int keep = 0;
+  if (keep != 0) return padding[keep];
+#endif
   std::string pipe_path;
   for (int i = 1; i + 1 < argc; ++i) {
     if (std::string(argv[i]) == "--config") std::getline(std::ifstream(argv[i + 1]), pipe_path);
