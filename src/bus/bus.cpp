@@ -162,6 +162,16 @@ void bus::on_remote_listeners(const std::uint32_t& pid, listener_list received) 
         << L"listeners of pid=" << pid << L" dropped: the process has disconnected";
     return;
   }
+  // Only a process connected to us has listeners here: a list for any other
+  // pid would stay for good, since no disconnect ever drops it. (A list that
+  // arrives before its sender's connect event is asked for again once the
+  // connection is known.)
+  if (connections_.count(pid) == 0) {
+    lock.unlock();
+    logger_stream(logging::level_info, L"bus::on_remote_listeners")
+        << L"listeners of pid=" << pid << L" dropped: no connection from that process";
+    return;
+  }
   auto entry = listeners_.find(pid);
   if (entry == listeners_.end() || entry->second.empty()) {
     post_new_listeners(notifier_, observer_list_, pid, received);
