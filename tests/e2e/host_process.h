@@ -253,12 +253,14 @@ class table_observer final : public ibus_observer {
 
 // This process as a peer: bus "main" with channel "alerts" exported on each
 // (pipe, level), imported over each pipe of `imports` (admitting a server at
-// `import_level`), and its listener `listener`.
+// `import_level`), and its listener `listener`; with `protected_image_paths`
+// it admits only peers whose image path their user cannot change.
 class this_process {
  public:
   this_process(const pipes& exports, const std::vector<std::string>& imports, const char* listener,
-               std::uint32_t import_level = 0) {
+               std::uint32_t import_level = 0, bool protected_image_paths = false) {
     provider_.local = {"alerts"};
+    provider_.protected_image_paths = protected_image_paths;
     for (const auto& [pipe, level] : exports) provider_.exports.push_back({"alerts", pipe, true, 3, level});
     for (const auto& pipe : imports) provider_.imports.push_back({"alerts", pipe, "alerts", "main", import_level});
     bus_ = registry_.create_bus("main", &provider_);

@@ -33,15 +33,40 @@ inline bytes hello() {
 }
 
 // A listeners message claiming `pid`, with `count` listeners of "alerts"
-// named prefix0, prefix1, ..., as a frame on "vorbel_service".
-inline bytes listeners(std::uint32_t pid, std::size_t count, const std::string& prefix) {
+// named prefix0, prefix1, ..., as a frame on "vorbel_service"; with
+// `claimed_origin`, it also carries the IPC library's origin blob naming that
+// pid, as a sender may try.
+inline bytes listeners(std::uint32_t pid, std::size_t count, const std::string& prefix,
+                       std::uint32_t claimed_origin = 0) {
   listener_list list;
   for (std::size_t i = 0; i < count; ++i) list.push_back(listener{"alerts", prefix + std::to_string(i)});
   parlo::codec::message_content content{2, {{"params", comm::encode_listeners(pid, list)}}};
+  if (claimed_origin != 0) {
+    const auto* o = reinterpret_cast<const unsigned char*>(&claimed_origin);  // little-endian, as the library writes it
+    content.fields.push_back({"parlo_ipc.origin_pid", {o[0], o[1], o[2], o[3]}});
+  }
   bytes wire, frame;
   parlo::codec::encode(content, wire);
   parlo::ipc::frame::encode_message("vorbel_service", wire.data(), wire.size(), frame);
   return frame;
+}
+
+// The IPC library's verdict on a client of ours, by its pid: "admitted",
+// "refused", or empty when none came in time.
+inline std::string verdict(DWORD pid) {
+  std::string seen;
+  test_support::wait_until([&] {
+    const std::wstring at = L" pid=" + std::to_wstring(pid) + L" ";
+    if (test_support::has_line(L"parlo_ipc::pipe_server::serve", at + L"admitted")) seen = "admitted";
+    if (test_support::has_line(L"parlo_ipc::pipe_server::serve", at + L"refused")) seen = "refused";
+    return !seen.empty();
+  }, 20s);
+  return seen;
+}
+
+inline std::string full_path(const std::string& relative) {
+  char full[MAX_PATH];
+  return std::string(full, ::GetFullPathNameA(relative.c_str(), MAX_PATH, full, nullptr));
 }
 
 // An intruder process aimed at `pipe`; `image` is intruder_a, intruder_b or

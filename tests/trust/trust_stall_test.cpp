@@ -1,8 +1,7 @@
 // Admission cannot be stalled: eight processes of another signer, each from
 // its own copy of a large image, connect at once to a pipe that only our
 // signer may use, and a genuine peer that connects meanwhile is admitted
-// within a second of its connect, and heard about within a second of the
-// time it takes alone.
+// within a second of its connect.
 //
 // 128 MiB images: verifying one takes about a second on the 2-core build
 // machine, so a connection admitted behind even one of them waits too long,
@@ -109,7 +108,10 @@ TEST(trust_stall_test, a_genuine_peer_is_admitted_while_large_images_of_another_
               alone.admitted, alone.heard, attackers, crowded.admitted, crowded.heard, attackers_done);
   EXPECT_TRUE(all_refused) << dump_log();
   EXPECT_LT(crowded.admitted, 1.0) << "the genuine peer waited for the attackers' verification";
-  EXPECT_LT(crowded.heard, alone.heard + 1.0) << "the attackers held the genuine peer back";
+  // The rest of the genuine peer's way (its own start, and its admission of
+  // us) shares the processors with the attackers' verification: a bound
+  // that one after another (6 s more) misses and sharing never reaches.
+  EXPECT_LT(crowded.heard, alone.heard + 3.0) << "the attackers held the genuine peer back";
 
   crowd.clear();
   for (const std::string& copy : copies) ::DeleteFileA(copy.c_str());
