@@ -63,8 +63,8 @@ bool granted_access(HANDLE token, const std::wstring& element, DWORD& granted, s
   DWORD privileges_length = sizeof(privileges);
   BOOL status = FALSE;
   granted = 0;
-  if (!::AccessCheck(descriptor.get(), token, MAXIMUM_ALLOWED, &mapping, &privileges, &privileges_length, &granted,
-                     &status)) {
+  if (!::AccessCheck(descriptor.get(), token, /* desired */ MAXIMUM_ALLOWED, &mapping, &privileges,
+                     &privileges_length, &granted, /* access_status */ &status)) {
     code = last_error();
     return false;
   }
@@ -75,8 +75,8 @@ bool granted_access(HANDLE token, const std::wstring& element, DWORD& granted, s
 }  // namespace
 
 winapi::unique_handle open_image(const std::wstring& path, std::error_code& code) {
-  HANDLE file = ::CreateFileW(path.c_str(), GENERIC_READ | FILE_EXECUTE, FILE_SHARE_READ, /* security */ nullptr,
-                              OPEN_EXISTING, FILE_ATTRIBUTE_NORMAL, /* template_file */ nullptr);
+  HANDLE file = ::CreateFileW(path.c_str(), /* access */ GENERIC_READ | FILE_EXECUTE, /* share */ FILE_SHARE_READ,
+                              /* security */ nullptr, OPEN_EXISTING, FILE_ATTRIBUTE_NORMAL, /* template_file */ nullptr);
   if (file == INVALID_HANDLE_VALUE) {
     code = last_error();
     return {};

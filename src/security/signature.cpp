@@ -236,6 +236,16 @@ image_verdict verify_image(HANDLE file, const std::wstring& path) {
 
   image_verdict verdict;
   GUID action = WINTRUST_ACTION_GENERIC_VERIFY_V2;
+  // The provider's state is closed however this function leaves.
+  struct state_closer {
+    WINTRUST_DATA& data;
+    GUID& action;
+    ~state_closer() {
+      if (data.hWVTStateData == nullptr) return;
+      data.dwStateAction = WTD_STATEACTION_CLOSE;
+      ::WinVerifyTrust(/* window */ nullptr, &action, &data);
+    }
+  } closer{data, action};
   const LONG result = ::WinVerifyTrust(/* window */ nullptr, &action, &data);
   switch (static_cast<DWORD>(result)) {
     case 0:
@@ -264,10 +274,6 @@ image_verdict verify_image(HANDLE file, const std::wstring& path) {
       logging::logger_stream(logging::level_warning, L"get_signature")
           << L"get_signature err=0x" << verdict.signer_code.value() << L" " << verdict.signer_code.message();
     }
-  }
-  if (data.hWVTStateData != nullptr) {
-    data.dwStateAction = WTD_STATEACTION_CLOSE;
-    ::WinVerifyTrust(/* window */ nullptr, &action, &data);
   }
   return verdict;
 }
