@@ -298,16 +298,16 @@ std::optional<trust_level> gateway_observer::classify(const process_info& info, 
   image_identity identity;
   if (!read_image_identity(file.get(), identity, code)) return signature_checker_.get_image_trust(file.get(), path);
   image = identity;
+  trust_level known = trust_cache_.find_image(identity);
   std::unique_lock<srw_mutex> gate(large_image_gate(), std::defer_lock);
-  // Looked up again after the gate: another process of the same large file
-  // may have been verified meanwhile.
-  for (const bool large : {false, identity.size >= large_image_size}) {
-    if (large) gate.lock();
-    const trust_level known = trust_cache_.find_image(identity);
-    if (known != trust_level::unknown) {
-      logger_stream(level_info, function) << L"image verified before, trust=" << trust_level_name(known);
-      return known;
-    }
+  if (known == trust_level::unknown && identity.size >= large_image_size) {
+    gate.lock();
+    // Another process of the same file may have been verified meanwhile.
+    known = trust_cache_.find_image(identity);
+  }
+  if (known != trust_level::unknown) {
+    logger_stream(level_info, function) << L"image verified before, trust=" << trust_level_name(known);
+    return known;
   }
   return signature_checker_.get_image_trust(file.get(), path);
 }

@@ -122,7 +122,7 @@ TEST_F(bus_test, remote_lists_are_merged_and_this_processs_own_ignored) {
   }
   EXPECT_TRUE(b.is_registered_listener("d", "w")) << "a remote listener counts";
   publish_as(own, {{"a", "x"}});
-  b.on_remote_listeners(own, {{"b", "y"}});
+  b.on_remote_listeners(own, {{"b", "y"}}, own);
   EXPECT_TRUE(settle().empty());
   EXPECT_FALSE(b.is_registered_listener("a", "x") || b.is_registered_listener("b", "y"));
 }

@@ -21,14 +21,16 @@ using namespace trust_test;
 const std::string pipe = "\\\\.\\pipe\\vorbel_trust_policy";
 const std::wstring path_unprotected = L"may change the image path: ";
 
-// An unsigned intruder run from a copy in this folder, which it may replace
-// with a signed image while it runs.
+// An unsigned intruder run from a copy in this folder, named after `name`
+// and this run, which it may replace with a signed image while it runs. (A
+// file of an ended process may stay in use for a moment, so no run reuses
+// another's names.)
 class swapper {
  public:
-  swapper() {
-    remove();
-    ::CopyFileA("..\\trust_peers\\intruder_unsigned.exe", "swapper.exe", FALSE);
-    peer = std::make_unique<intruder>(".\\swapper.exe", "swapper", pipe);
+  explicit swapper(const std::string& name)
+      : image_(name + "_" + std::to_string(::GetCurrentProcessId()) + ".exe") {
+    ::CopyFileA("..\\trust_peers\\intruder_unsigned.exe", image_.c_str(), FALSE);
+    peer = std::make_unique<intruder>(".\\" + image_, name, pipe);
   }
   ~swapper() {
     peer.reset();
@@ -37,10 +39,15 @@ class swapper {
   std::unique_ptr<intruder> peer;
 
  private:
-  static void remove() {
-    ::DeleteFileA("swapper.exe");
-    ::DeleteFileA("swapper.exe.aside");
+  void remove() const {
+    wait_until([&] {
+      ::SetFileAttributesA(image_.c_str(), FILE_ATTRIBUTE_NORMAL);  // a copy of a read-only image
+      ::DeleteFileA(image_.c_str());
+      ::DeleteFileA((image_ + ".aside").c_str());
+      return ::GetFileAttributesA((image_ + ".aside").c_str()) == INVALID_FILE_ATTRIBUTES;
+    }, 5s);
   }
+  const std::string image_;
 };
 
 class trust_policy_test : public ::testing::Test {
@@ -51,7 +58,7 @@ class trust_policy_test : public ::testing::Test {
 TEST_F(trust_policy_test, a_peer_that_swaps_its_image_for_a_signed_one_is_caught_where_the_system_can_tell) {
   this_process us({{pipe, 0}}, {}, "server");
   ASSERT_TRUE(us.up()) << dump_log();
-  swapper s;
+  swapper s("swapper_unchecked");
   ASSERT_TRUE(s.peer->ready()) << s.peer->output();
   ASSERT_EQ("ok", s.peer->run("swap " + full_path("..\\trust_peers\\intruder_a.exe")));
   ASSERT_EQ("ok server=" + std::to_string(own()), s.peer->run("connect"));
@@ -91,7 +98,7 @@ TEST_F(trust_policy_test, the_protected_path_policy_admits_only_images_their_use
   }
   // The swap of the test above, now refused whatever the system can tell.
   clear_log();
-  swapper s;
+  swapper s("swapper_policy");
   ASSERT_TRUE(s.peer->ready()) << s.peer->output();
   ASSERT_EQ("ok", s.peer->run("swap T:\\images\\intruder_a.exe"));
   ASSERT_EQ("ok server=" + std::to_string(own()), s.peer->run("connect"));

@@ -214,7 +214,7 @@ void service_channel::on_message(parlo::message* message) {
   // This runs on the messaging library's delivery thread: nothing may
   // escape it, or the process ends.
   try {
-    observer_->on_remote_listeners(pid, read_listeners(data));
+    observer_->on_remote_listeners(pid, read_listeners(data), origin);
   } catch (const std::exception& e) {
     logger_stream(level_error, L"comm::service_channel::on_message")
         << L"listeners message of pid=" << pid << L" dropped: " << e.what();

@@ -48,7 +48,10 @@ struct iservice_channel_observer {
   // A process asked for this process's listeners.
   virtual std::uint32_t on_listeners_requested() = 0;
   // A process published its listeners; the list is the observer's.
-  virtual void on_remote_listeners(const std::uint32_t& pid, listener_list listeners) = 0;
+  // `origin` is `pid` when the IPC library delivered the list from that
+  // process's connection (which it had admitted), 0 when nobody said where
+  // it came from.
+  virtual void on_remote_listeners(const std::uint32_t& pid, listener_list listeners, std::uint32_t origin) = 0;
 
  protected:
   ~iservice_channel_observer() = default;
