@@ -102,8 +102,14 @@ TEST_F(bus_test, duplicates_are_kept_and_removed_one_at_a_time_each_change_publi
 }
 
 // Additions before removals; an empty list empties the process's entry; a
-// list carrying this process's own id is ignored.
+// list carrying this process's own id is ignored, and so is one of a process
+// that no connection carries.
 TEST_F(bus_test, remote_lists_are_merged_and_this_processs_own_ignored) {
+  publish_as(other_pid + 4, {{"a", "x"}});
+  EXPECT_TRUE(settle().empty());
+  EXPECT_TRUE(test_support::has_line(L"bus::on_remote_listeners", L"pid=4246 dropped: no connection from that process"));
+  b.on_local_connect("\\pipe", other_pid);
+  settle();
   const std::pair<listener_list, notifications> steps[] = {
       {{{"a", "x"}, {"c", "z"}}, {added(other_pid, "a", "x"), added(other_pid, "c", "z")}},
       {{{"a", "x"}, {"b", "y"}}, {added(other_pid, "b", "y"), removed(other_pid, "c", "z")}},
@@ -116,7 +122,7 @@ TEST_F(bus_test, remote_lists_are_merged_and_this_processs_own_ignored) {
   }
   EXPECT_TRUE(b.is_registered_listener("d", "w")) << "a remote listener counts";
   publish_as(own, {{"a", "x"}});
-  b.on_remote_listeners(own, {{"b", "y"}});
+  b.on_remote_listeners(own, {{"b", "y"}}, own);
   EXPECT_TRUE(settle().empty());
   EXPECT_FALSE(b.is_registered_listener("a", "x") || b.is_registered_listener("b", "y"));
 }
