@@ -32,3 +32,21 @@ struct ibus_configuration : IQmBaseInterface {
                                      std::uint32_t* security, const char** remote_channel_name,
                                      const char** remote_bus_name) = 0;
 };
+
+// {5C6B2A1E-7F3D-4E0A-9B84-2D61C0F7A935}: an optional face of the
+// configuration provider, asked for with the provider's GetInterface while a
+// bus's gateway is built. A provider that answers null keeps the defaults.
+inline constexpr GUID IID_ibus_trust_policy = {
+    0x5C6B2A1E, 0x7F3D, 0x4E0A, {0x9B, 0x84, 0x2D, 0x61, 0xC0, 0xF7, 0xA9, 0x35}};
+
+// How far the bus's gateway trusts a peer beyond its code signature.
+struct ibus_trust_policy : IQmBaseInterface {
+  // True: a peer (a client of our pipes, or a server we join) is admitted
+  // only when the user it runs as can neither remove nor rename its image
+  // file or any folder on the image's path, nor change their permissions, nor
+  // write the image; so that nobody of that user can swap the file that was
+  // verified for another. Images installed under a folder that only
+  // administrators may change pass; an image in the user's own folders does
+  // not. Default false.
+  virtual bool protected_image_paths_only() = 0;
+};

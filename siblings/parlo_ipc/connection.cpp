@@ -6,6 +6,7 @@
 
 #include "gateway_impl.h"
 #include "logging/logger.h"
+#include "message_codec.h"
 #include "pipe_support.h"
 
 namespace parlo::ipc::impl {
@@ -24,6 +25,28 @@ constexpr DWORD inject_retry_ms = 10;
 bool peer_gone(DWORD err) {
   return err == ERROR_BROKEN_PIPE || err == ERROR_PIPE_NOT_CONNECTED || err == ERROR_NO_DATA ||
          err == ERROR_OPERATION_ABORTED;
+}
+
+// `message` with the origin blob set to `pid`, whatever the sender put under
+// that name: only the receiving side knows who sent it. `why` tells what
+// failed: the decoding (the sender broke the protocol) or, after it, the
+// encoding (a message at the limits has no room for the blob).
+enum class stamp_result { ok, undecodable, no_room };
+stamp_result stamp_origin(const frame::message_view& message, std::uint32_t pid, std::vector<unsigned char>& out,
+                          parlo::codec::status& why) {
+  parlo::codec::message_content content;
+  why = parlo::codec::decode(message.wire, message.wire_size, content);
+  if (why != parlo::codec::status::ok) return stamp_result::undecodable;
+  auto& fields = content.fields;
+  fields.erase(std::remove_if(fields.begin(), fields.end(),
+                              [](const parlo::codec::blob_field& f) { return f.name == origin_pid_blob; }),
+               fields.end());
+  fields.push_back(parlo::codec::blob_field{
+      origin_pid_blob,
+      {static_cast<unsigned char>(pid), static_cast<unsigned char>(pid >> 8), static_cast<unsigned char>(pid >> 16),
+       static_cast<unsigned char>(pid >> 24)}});
+  why = parlo::codec::encode(content, out);
+  return why == parlo::codec::status::ok ? stamp_result::ok : stamp_result::no_room;
 }
 
 }  // namespace
@@ -334,10 +357,25 @@ std::uint32_t connection::handle_frame(const frame::frame_reader& reader) {
 }
 
 std::uint32_t connection::inject(const std::string& channel, const frame::message_view& message) {
+  std::vector<unsigned char> stamped;
+  parlo::codec::status why = parlo::codec::status::ok;
+  const stamp_result stamp = stamp_origin(message, peer_pid_, stamped, why);
+  if (stamp == stamp_result::no_room) {
+    logging::logger_stream(logging::level_warning, log_name())
+        << L"pipe=" << pipe_name_ << L" handle=" << handle() << L" channel=" << channel
+        << L": message dropped, no room for its origin (" << parlo::codec::status_text(why) << L")";
+    return 0;
+  }
+  if (stamp == stamp_result::undecodable) {
+    // The peer sent bytes that are not a message: it breaks the protocol.
+    logging::logger_stream(logging::level_error, log_name())
+        << L"pipe=" << pipe_name_ << L" handle=" << handle() << L" channel=" << channel
+        << L": undecodable message, err=" << parlo::error_invalid_data;
+    return ERROR_INVALID_DATA;
+  }
   const parlo_api& api = gateway_.api();
   for (int attempt = 0; attempt < inject_attempts; ++attempt) {
-    const std::uint32_t result =
-        api.inject(gateway_.bus(), channel.c_str(), message.wire, message.wire_size);
+    const std::uint32_t result = api.inject(gateway_.bus(), channel.c_str(), stamped.data(), stamped.size());
     switch (result) {
       case 0:
         return 0;

@@ -45,6 +45,10 @@ class connection {
   virtual ~connection() = default;
 
   HANDLE handle() const { return pipe_.get(); }
+  // The process at the other end, as the system reported it; set once,
+  // before run(), and stamped on every message delivered from the pipe.
+  void set_peer_pid(std::uint32_t pid) { peer_pid_ = pid; }
+  std::uint32_t peer_pid() const { return peer_pid_; }
   // Whether the construction got its wake event; a connection without it is
   // closed at once.
   bool usable() const { return static_cast<bool>(wake_event_); }
@@ -73,9 +77,10 @@ class connection {
   virtual std::uint32_t on_hello(const frame::hello& hello) = 0;
   virtual std::uint32_t on_message(const frame::message_view& message) = 0;
 
-  // Delivers a message's wire bytes to local channel `channel`: retries a
-  // full delivery queue for a while. 0 when delivered or dropped (with a
-  // line), or the code of an error that ends the connection.
+  // Delivers a message to local channel `channel`, with the origin blob set
+  // to the peer's pid: retries a full delivery queue for a while. 0 when
+  // delivered or dropped (with a line), or the code of an error that ends
+  // the connection.
   std::uint32_t inject(const std::string& channel, const frame::message_view& message);
 
   gateway_impl& gateway_;
@@ -94,6 +99,7 @@ class connection {
   const wchar_t* log_name() const;
 
   winapi::unique_handle pipe_;
+  std::uint32_t peer_pid_ = 0;
   winapi::unique_handle wake_event_;  // auto-reset: a frame was queued
 
   srw_mutex mutex_;  // guards the queue

@@ -47,7 +47,8 @@
 //   served pipes:  on_listen(h, name) when instance h starts listening;
 //                  on_local_connect(h, client pid) before anything is read
 //                  from it - false disconnects the client and h gets no
-//                  other event; on_local_start_communication(h) when the
+//                  other event; the connect events of several clients may
+//                  run at once; on_local_start_communication(h) when the
 //                  client's hello is in; on_local_error(h, err) when the
 //                  connection fails (13 a malformed or oversized frame or a
 //                  broken protocol, 1816 a client that does not read, or the
@@ -60,6 +61,11 @@
 //   Nothing is written to a connection before its connect event admitted
 //   it, and every message posted on its channels after the event returned
 //   reaches it. No event is raised once stop (or destroy_gateway) returned.
+//   Every message delivered from a connection carries the blob
+//   "parlo_ipc.origin_pid" with the peer's pid as the system reported it
+//   (GetNamedPipeClientProcessId, GetNamedPipeServerProcessId), replacing
+//   whatever the peer put under that name; a message with no room left for
+//   it is dropped with a line.
 //
 // Threads: one listener per served pipe, one per client connection (at most
 // 64 per pipe), one per opened pipe; all end in stop. The tap callback only
@@ -413,17 +419,13 @@ void guarded(const wchar_t* event, HANDLE pipe, Call&& call) {
 
 }  // namespace
 
-// The sink may set a DACL on the pipe on these two events; the pipe's DACL is
-// protected again afterwards so that the next one applies cleanly under Wine.
 void gateway_impl::raise_listen(HANDLE pipe, const char* name) {
   guarded(L"on_listen", pipe, [&] { sink_->on_listen(pipe, name); });
-  reprotect_dacl(pipe);
 }
 
 bool gateway_impl::raise_local_connect(HANDLE pipe, std::uint32_t pid) {
   bool admitted = false;
   guarded(L"on_local_connect", pipe, [&] { admitted = sink_->on_local_connect(pipe, pid); });
-  if (admitted) reprotect_dacl(pipe);
   return admitted;
 }
 

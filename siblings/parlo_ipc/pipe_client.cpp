@@ -102,9 +102,11 @@ void pipe_client::run() {
   DWORD last_err = 0;
   while (!gateway_.stopping()) {
     // SECURITY_IDENTIFICATION: the server may learn who we are but can never
-    // act as us.
+    // act as us. FILE_WRITE_DATA rather than GENERIC_WRITE, which would ask
+    // for FILE_CREATE_PIPE_INSTANCE too: a pipe's DACL grants clients the
+    // right to talk, not the right to serve the name.
     HANDLE opened = ::CreateFileW(
-        config_.path.c_str(), GENERIC_READ | GENERIC_WRITE, /* share_mode */ 0,
+        config_.path.c_str(), GENERIC_READ | FILE_WRITE_DATA | FILE_WRITE_ATTRIBUTES, /* share_mode */ 0,
         /* security */ nullptr, OPEN_EXISTING,
         /* flags */ FILE_FLAG_OVERLAPPED | SECURITY_SQOS_PRESENT | SECURITY_IDENTIFICATION,
         /* template_file */ nullptr);
@@ -137,6 +139,7 @@ void pipe_client::run() {
     std::shared_ptr<client_connection> link;
     try {
       link = std::make_shared<client_connection>(gateway_, std::move(pipe), *this);
+      link->set_peer_pid(pid);
       link->enqueue(hello_);
     } catch (const std::bad_alloc&) {
       logging::logger_stream(logging::level_error, L"parlo_ipc::pipe_client::run")

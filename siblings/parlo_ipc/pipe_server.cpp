@@ -165,7 +165,6 @@ void pipe_server::listen() {
       announced = false;
     }
     if (!announced) {
-      std::lock_guard<srw_mutex> lock(dacl_mutex_);
       gateway_.raise_listen(instance.get(), config_.name.c_str());
       announced = true;
     }
@@ -278,7 +277,7 @@ void pipe_server::serve(worker& work) {
         << L"pipe=" << config_.name << L" handle=" << link.handle()
         << L" GetNamedPipeClientProcessId err=" << err;
   } else {
-    std::lock_guard<srw_mutex> lock(dacl_mutex_);
+    link.set_peer_pid(pid);
     admitted = gateway_.raise_local_connect(link.handle(), pid);
   }
   if (!admitted) {

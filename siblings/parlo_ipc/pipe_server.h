@@ -52,9 +52,11 @@ class server_connection final : public connection {
 };
 
 // Owned by the gateway while it runs. Threads: the listener thread runs
-// listen() and starts one thread per client connection (serve()); the
-// gateway's control thread calls open(), start() and join(); the tap calls
-// forward() on the bus's delivery thread.
+// listen() and starts one thread per client connection (serve()), which
+// raises the client's connect event: admissions of several clients run at
+// once, so a slow one holds back no other. The gateway's control thread
+// calls open(), start() and join(); the tap calls forward() on the bus's
+// delivery thread.
 class pipe_server {
  public:
   pipe_server(gateway_impl& gateway, const exported_pipe& config);
@@ -103,14 +105,6 @@ class pipe_server {
 
   srw_mutex mutex_;  // guards routed_
   std::vector<std::shared_ptr<server_connection>> routed_;
-
-  // Held through each event that may set the pipe's DACL (on_listen,
-  // on_local_connect) and the re-protection after it. Under Wine every
-  // instance of a pipe name shares one security descriptor: a DACL set on
-  // the next instance while a client's admission sets one on its own would
-  // leave the descriptor unprotected under the other call, which then
-  // crashes inside Wine's SetSecurityInfo.
-  srw_mutex dacl_mutex_;
 };
 
 }  // namespace parlo::ipc::impl

@@ -78,8 +78,7 @@ DWORD make_initial_pipe_security(unique_local& descriptor) {
   wchar_t* raw_sid = nullptr;
   if (!::ConvertSidToStringSidW(user->User.Sid, &raw_sid)) return ::GetLastError();
   unique_local sid_text(raw_sid);
-  // D:P           protected DACL: nothing inherited, and SetSecurityInfo may
-  //               replace it (Wine refuses an unprotected one)
+  // D:P           protected DACL: nothing inherited
   // (A;;GA;;;SY)  allow GENERIC_ALL to LocalSystem
   // (A;;GA;;;<u>) allow GENERIC_ALL to the user this process runs as
   const std::wstring sddl =
@@ -91,24 +90,6 @@ DWORD make_initial_pipe_security(unique_local& descriptor) {
     return ::GetLastError();
   }
   descriptor.reset(raw_descriptor);
-  return 0;
-}
-
-DWORD reprotect_dacl(HANDLE pipe) {
-  PACL dacl = nullptr;
-  PSECURITY_DESCRIPTOR raw_current = nullptr;
-  const DWORD read = ::GetSecurityInfo(pipe, SE_KERNEL_OBJECT, DACL_SECURITY_INFORMATION,
-                                       /* owner */ nullptr, /* group */ nullptr, &dacl,
-                                       /* sacl */ nullptr, &raw_current);
-  if (read != ERROR_SUCCESS) return read;
-  unique_local current(raw_current);
-  SECURITY_DESCRIPTOR protected_dacl;
-  if (!::InitializeSecurityDescriptor(&protected_dacl, SECURITY_DESCRIPTOR_REVISION) ||
-      !::SetSecurityDescriptorDacl(&protected_dacl, /* present */ TRUE, dacl, /* defaulted */ FALSE) ||
-      !::SetSecurityDescriptorControl(&protected_dacl, SE_DACL_PROTECTED, SE_DACL_PROTECTED) ||
-      !::SetKernelObjectSecurity(pipe, DACL_SECURITY_INFORMATION, &protected_dacl)) {
-    return ::GetLastError();
-  }
   return 0;
 }
 

@@ -32,16 +32,8 @@ struct local_free_traits {
 using unique_local = winapi::unique_any<local_free_traits>;
 
 // The security descriptor every pipe instance starts with: a protected DACL
-// that admits only SYSTEM and the current user. The component replaces the
-// DACL through SetSecurityInfo when it hears on_listen, which Wine allows only
-// on a pipe whose current DACL is protected. 0, or the Win32 code.
+// that admits only SYSTEM and the current user, until the component puts its
+// own DACL on the pipe when it hears on_listen. 0, or the Win32 code.
 DWORD make_initial_pipe_security(unique_local& descriptor);
-
-// Marks the pipe's current DACL protected again. Wine drops the protection
-// whenever SetSecurityInfo sets a DACL, and then crashes in the next
-// SetSecurityInfo on the handle; the component sets one on listen and again on
-// an admitted connection of the same instance. Windows keeps the protection;
-// there this changes nothing. 0, or the Win32 code.
-DWORD reprotect_dacl(HANDLE pipe);
 
 }  // namespace parlo::ipc::impl

@@ -257,13 +257,25 @@ std::uint32_t bus::on_listeners_requested() {
   return 0;
 }
 
-void bus::on_remote_listeners(const std::uint32_t& pid, listener_list received) {
+void bus::on_remote_listeners(const std::uint32_t& pid, listener_list received, std::uint32_t origin) {
   if (pid == pid_) return;
   std::unique_lock<srw_mutex> lock(mutex_);
   if (departed_.count(pid) != 0) {
     lock.unlock();  // no lock is held while a line is written
     logger_stream(logging::level_info, L"bus::on_remote_listeners")
         << L"listeners of pid=" << pid << L" dropped: the process has disconnected";
+    return;
+  }
+  // Only a process connected to us has listeners here: a list for any other
+  // pid would stay for good, since no disconnect ever drops it. A list the
+  // IPC library delivered from the process's own connection proves one (its
+  // connect event may still be on its way to us); a list of unknown origin
+  // needs a connection this bus has heard of (and one that came before its
+  // connect event is asked for again once the connection is known).
+  if (origin == 0 && connections_.count(pid) == 0) {
+    lock.unlock();
+    logger_stream(logging::level_info, L"bus::on_remote_listeners")
+        << L"listeners of pid=" << pid << L" dropped: no connection from that process";
     return;
   }
   auto entry = listeners_.find(pid);

@@ -63,7 +63,7 @@ class bus final : public qm::observable<ibus_observer_base*, ibus>,
 
   // comm::iservice_channel_observer
   std::uint32_t on_listeners_requested() override;
-  void on_remote_listeners(const std::uint32_t& pid, listener_list listeners) override;
+  void on_remote_listeners(const std::uint32_t& pid, listener_list listeners, std::uint32_t origin) override;
 
   // igateway_observer
   void on_listen(const char* name) override;

@@ -77,6 +77,11 @@ std::uint32_t gateway::export_channel(const char* channel_name, const char* pipe
   }
   logger_stream(level_info, L"gateway::export_channel")
       << L"channel=" << channel_name << L" link_type=" << link_type << L" security=" << security;
+  if (security > max_pipe_security_level) {
+    logger_stream(level_error, L"gateway::export_channel")
+        << L"security=" << security << L" is no pipe security level (0 or 1): pipe=" << pipe_name << L" refused";
+    return ERROR_INVALID_PARAMETER;
+  }
   pipes_[pipe_name] = security;
   const std::uint32_t result = ipc_->export_channel(channel_name, pipe_name, link_type);
   if (result != 0) {
@@ -100,6 +105,11 @@ std::uint32_t gateway::import_channel(const char* remote_bus_name, const char* c
   logger_stream(level_info, L"gateway::import_channel")
       << L"bus_name=" << remote_bus_name << L" channel=" << channel_name << L" link_type="
       << link_type << L" security=" << security;
+  if (security > max_pipe_security_level) {
+    logger_stream(level_error, L"gateway::import_channel")
+        << L"security=" << security << L" is no pipe security level (0 or 1): pipe=" << pipe_name << L" refused";
+    return ERROR_INVALID_PARAMETER;
+  }
   pipes_[pipe_name] = security;
   const std::uint32_t result =
       ipc_->import_channel(channel_name, pipe_name, remote_bus_name, remote_channel_name, link_type);

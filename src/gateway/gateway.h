@@ -35,7 +35,9 @@ class gateway final : public qm::observable<igateway_observer_base*, igateway> {
   void* GetInterface(GUID iid) override;
 
   // Each also carries the bus's service channel over the same pipe. `security`
-  // is the pipe's admission level (0: same signer only, 1: any valid signer).
+  // is the pipe's admission level (0: same signer only, 1: any valid signer),
+  // for the clients of an exported pipe and the server of an imported one;
+  // any other level is refused with 87 and a line, and nothing is set up.
   std::uint32_t export_channel(const char* channel_name, const char* pipe_name,
                                std::uint32_t link_type, std::uint32_t security);
   std::uint32_t import_channel(const char* remote_bus_name, const char* channel_name,

@@ -1,11 +1,13 @@
 #include "gateway/gateway_observer.h"
 
+#include <iomanip>
 #include <mutex>
 #include <system_error>
 
 #include "logging/logger.h"
 #include "platform/srw_sync.h"
 #include "platform/win_api.h"
+#include "security/image_file.h"
 #include "security/signature.h"
 
 using logging::level_info;
@@ -14,8 +16,24 @@ using logging::logger_stream;
 
 namespace {
 
-constexpr DWORD process_query_and_read = PROCESS_QUERY_INFORMATION | PROCESS_VM_READ;  // 0x410
+// The peer as the kernel knows it (creation time, image path), and a handle
+// the trust cache can wait on until it exits. Nothing is read from the peer's
+// own memory.
+constexpr DWORD process_query_and_wait = PROCESS_QUERY_LIMITED_INFORMATION | SYNCHRONIZE;  // 0x101000
 constexpr std::size_t pipe_prefix_length = 8;  // "\\.\PIPE"
+
+// Images at least this large are verified one at a time, process-wide.
+// Hashing a few hundred MiB takes seconds of a core; many at once (a crowd
+// of large images connecting together) would leave a genuine peer's small
+// image a sliver of the processors for as long as they last. Smaller images
+// are verified at once, in parallel with everything. (Lowering the
+// verifying thread's priority would do on Windows; Wine ignores thread
+// priorities.)
+constexpr std::uint64_t large_image_size = std::uint64_t{32} << 20;
+srw_mutex& large_image_gate() {
+  static srw_mutex gate;
+  return gate;
+}
 
 // The checker holds the current process's signature only when it was read
 // without error and names a signer.
@@ -56,6 +74,17 @@ std::optional<std::uint32_t> get_pipe_security(const pipe_security_map& map, HAN
   return found->second;
 }
 
+bool admits(trust_level trust, std::uint32_t level) {
+  switch (level) {
+    case 0:
+      return trust == trust_level::high_trust;
+    case 1:
+      return trust == trust_level::high_trust || trust == trust_level::low_trust;
+    default:
+      return false;
+  }
+}
+
 pipe_security_map make_pipe_security_map(const std::map<std::string, std::uint32_t>& pipes) {
   pipe_security_map map;
   for (const auto& [name, level] : pipes) {
@@ -67,9 +96,15 @@ pipe_security_map make_pipe_security_map(const std::map<std::string, std::uint32
 gateway_observer::gateway_observer(gateway_observer_list* observers)
     : context_(std::make_unique<notify_context>(observers)),
       signature_checker_(current_signature_for_checker()),
-      pipes_security_descriptor_(make_pipes_security_descriptor()) {
+      pipes_security_descriptor_(make_pipes_security_descriptor()),
+      running_image_checked_(running_image_check_supported()) {
   std::error_code ignored;
   adjust_process_priviledges(ignored);
+  if (!running_image_checked_) {
+    logger_stream(level_warning, L"gateway_observer::gateway_observer")
+        << L"this system cannot tell whether a peer's image file is the file it runs: a peer that swaps its "
+           L"image file for another is not detected";
+  }
 }
 
 gateway_observer::~gateway_observer() = default;
@@ -112,7 +147,7 @@ bool gateway_observer::on_local_connect(parlo::ipc::pipe_handle pipe, std::uint3
   logging::trace_scope trace(L"gateway_observer::on_local_connect");
   logger_stream(level_info, L"gateway_observer::on_local_connect")
       << L"pid=" << pid << L" handle=" << pipe;
-  if (!is_allowed(pipe, pid)) return false;
+  if (!is_allowed(pipe, pid, /* remote */ false)) return false;
   apply_security(pipe);
   // The name is read now: the handle is the library's, closed soon after the
   // disconnect.
@@ -158,6 +193,9 @@ bool gateway_observer::on_remote_connect(parlo::ipc::pipe_handle pipe, std::uint
   logging::trace_scope trace(L"gateway_observer::on_remote_connect");
   logger_stream(level_info, L"gateway_observer::on_remote_connect")
       << L"pid=" << pid << L" handle=" << pipe;
+  // The server we joined is judged like a client of ours: a process of
+  // another signer may serve the name first, or as one more instance.
+  if (!is_allowed(pipe, pid, /* remote */ true)) return false;
   post_pair(make_connection_insert(&context_->connections, pipe, get_pipe_name(pipe), pid),
             event_task(gateway_event::remote_connect, pipe, pid));
   return true;
@@ -195,10 +233,12 @@ void gateway_observer::on_remote_error(parlo::ipc::pipe_handle pipe, std::uint32
   logging::log_current_exception(L"gateway_observer::on_remote_error");
 }
 
-bool gateway_observer::is_allowed(HANDLE pipe, std::uint32_t pid) {
+bool gateway_observer::is_allowed(HANDLE pipe, std::uint32_t pid, bool remote) {
   if (!signature_checker_.has_signature()) {
-    logger_stream(level_info, L"gateway_observer::is_allowed")
-        << L"current process signature is invalid => DENY ALL";
+    if (!remote || !remote_deny_all_said_.exchange(true)) {
+      logger_stream(level_info, L"gateway_observer::is_allowed")
+          << L"current process signature is invalid => DENY ALL";
+    }
     return false;
   }
   const std::optional<std::uint32_t> level = get_pipe_security(pipe_security_, pipe);
@@ -218,27 +258,21 @@ bool gateway_observer::is_allowed(HANDLE pipe, std::uint32_t pid) {
 bool gateway_observer::is_allowed_process(std::uint32_t pid, std::uint32_t level) {
   logging::trace_scope trace(L"gateway_observer::is_allowed_process");
   try {
-    process_info info;
-    {
-      winapi::unique_handle process = winapi::open_process(process_query_and_read, pid);
-      info = get_process_info(pid, process.get());
-    }
+    // One handle for everything: while it is open the pid cannot name
+    // another process.
+    winapi::unique_handle process = winapi::open_process(process_query_and_wait, pid);
+    const process_info info = get_process_info(pid, process.get());
     const trust_level cached = trust_cache_.find(info);
     if (cached != trust_level::unknown) {
       logger_stream(level_info, L"gateway_observer::is_allowed_process")
           << L"found it in cache, trust=" << trust_level_name(cached);
-      if (cached == trust_level::untrusted) return false;
-      if (level == 1) return cached == trust_level::low_trust || cached == trust_level::high_trust;
-      return cached == trust_level::high_trust;
+      return admits(cached, level);
     }
-    const trust_level trust = signature_checker_.get_process_trust(info.image_path.wstring());
-    cache_process(info, trust);
-    switch (trust) {
-      case trust_level::untrusted: return false;
-      case trust_level::high_trust: return true;
-      case trust_level::low_trust: return level != 0;
-      default: return false;
-    }
+    std::optional<image_identity> image;
+    const std::optional<trust_level> trust = classify(info, process.get(), image);
+    if (!trust) return false;
+    cache_process(info, std::move(process), *trust, image);
+    return admits(*trust, level);
   } catch (const std::system_error& e) {
     logger_stream(level_info, L"gateway_observer::is_allowed_process")
         << L"get_process_info failed err=" << e.code().category().name() << L":" << std::hex
@@ -251,16 +285,70 @@ bool gateway_observer::is_allowed_process(std::uint32_t pid, std::uint32_t level
   }
 }
 
-void gateway_observer::cache_process(const process_info& info, trust_level trust) {
-  HANDLE process = ::OpenProcess(SYNCHRONIZE, /* inherit */ FALSE, info.pid);
-  if (process == nullptr) {
-    const DWORD err = ::GetLastError();
-    logger_stream(level_warning, L"gateway_observer::cache_process")
-        << L"failed open for synchronize err=0x" << err << L" "
-        << winapi::make_win_error(err).message();
-    return;
+std::optional<trust_level> gateway_observer::classify(const process_info& info, HANDLE process,
+                                                      std::optional<image_identity>& image) {
+  const wchar_t* const function = L"gateway_observer::is_allowed_process";
+  const std::wstring path = info.image_path.wstring();
+  // Every check below looks at this one file: while it is open nobody can
+  // write, rename or delete it.
+  std::error_code code;
+  const winapi::unique_handle file = open_image(path, code);
+  if (!file) {
+    logger_stream(level_info, function) << L"cannot open image " << std::quoted(path) << L" err=" << code.value();
+    return std::nullopt;
   }
-  trust_cache_.add(info, winapi::unique_handle(process), trust);
+  if (running_image_checked_) {
+    // A query right of its own: the kernel answers only with it. The pid
+    // still names our process: `process` is open.
+    winapi::unique_handle query(::OpenProcess(PROCESS_QUERY_INFORMATION, /* inherit */ FALSE, info.pid));
+    const DWORD open_err = ::GetLastError();
+    const running_image match = query ? check_running_image(query.get(), file.get(), code)
+                                      : running_image::failed;
+    if (!query) code = winapi::make_win_error(open_err);
+    if (match == running_image::failed) {
+      logger_stream(level_info, function)
+          << L"cannot tell whether pid=" << info.pid << L" runs " << std::quoted(path) << L" err=" << code.value();
+      return std::nullopt;
+    }
+    if (match == running_image::different) {
+      logger_stream(level_warning, function)
+          << L"pid=" << info.pid << L" does not run " << std::quoted(path) << L", the file now at its image's path";
+      return trust_level::untrusted;
+    }
+  }
+  if (protected_image_paths_) {
+    std::wstring where;
+    if (!is_protected_image_path(process, path, where, code)) {
+      if (code) {
+        logger_stream(level_info, function)
+            << L"cannot tell whether the image path of pid=" << info.pid << L" is protected err=" << code.value();
+        return std::nullopt;
+      }
+      logger_stream(level_warning, function)
+          << L"the user of pid=" << info.pid << L" may change the image path: " << where;
+      return trust_level::untrusted;
+    }
+  }
+  image_identity identity;
+  if (!read_image_identity(file.get(), identity, code)) return signature_checker_.get_image_trust(file.get(), path);
+  image = identity;
+  trust_level known = trust_cache_.find_image(identity);
+  std::unique_lock<srw_mutex> gate(large_image_gate(), std::defer_lock);
+  if (known == trust_level::unknown && identity.size >= large_image_size) {
+    gate.lock();
+    // Another process of the same file may have been verified meanwhile.
+    known = trust_cache_.find_image(identity);
+  }
+  if (known != trust_level::unknown) {
+    logger_stream(level_info, function) << L"image verified before, trust=" << trust_level_name(known);
+    return known;
+  }
+  return signature_checker_.get_image_trust(file.get(), path);
+}
+
+void gateway_observer::cache_process(const process_info& info, winapi::unique_handle process, trust_level trust,
+                                     const std::optional<image_identity>& image) {
+  trust_cache_.add(info, std::move(process), trust, image);
 }
 
 void gateway_observer::run_on_worker(const std::function<void(connections_cache&)>& probe) {

@@ -3,9 +3,12 @@
 // Owned by the gateway, which creates it before the IPC library's gateway
 // and destroys it after that (so no library thread can call a destroyed
 // sink). The library calls the nine event operations from its own threads,
-// possibly several at once. Admission reads the signature checker and the
-// pipe security map without a lock (both are fixed before the library
-// starts) and uses the trust cache's own mutex. Everything that touches the
+// possibly several at once, and several admissions run at once. Admission
+// reads the signature checker, the pipe security map and the image-path
+// policy without a lock (all are fixed before the library starts) and uses
+// the trust cache's own mutex. Both sides admit: a client connecting to one
+// of our pipes (on_local_connect), and a server we connect to
+// (on_remote_connect), each at the level configured for the pipe. Everything that touches the
 // connections cache or the gateway's observers runs as a task on the notify
 // context's single worker: the event operations only post, so the library's
 // threads never wait for observers.
@@ -13,6 +16,7 @@
 
 #include <windows.h>
 
+#include <atomic>
 #include <cstdint>
 #include <functional>
 #include <map>
@@ -30,6 +34,14 @@
 // Pipe name (a backslash and the pipe's own name, UTF-8) → pipe security
 // level: 0 admits high_trust peers only, 1 also low_trust peers.
 using pipe_security_map = std::map<std::string, std::uint32_t>;
+
+// The highest pipe security level; the gateway refuses others.
+inline constexpr std::uint32_t max_pipe_security_level = 1;
+
+// The one decision rule, for a first classification and a cached one alike:
+// level 0 admits high_trust, level 1 high_trust and low_trust; untrusted,
+// unknown and any other level admit nobody.
+bool admits(trust_level trust, std::uint32_t level);
 
 // The level of the pipe behind `pipe`, read by its name; absent when the name
 // cannot be read or the pipe is not in `map`.
@@ -63,11 +75,18 @@ class gateway_observer final : public parlo::ipc::gateway::events {
   // The trust part of admission: may process `pid` connect to a pipe of
   // security `level`?
   bool is_allowed_process(std::uint32_t pid, std::uint32_t level);
-  // Remembers a freshly classified process until it exits.
-  void cache_process(const process_info& info, trust_level trust);
+  // Remembers a freshly classified process until it exits; `process` is the
+  // handle it was classified through (SYNCHRONIZE access), `image` the
+  // identity of the file whose verdict `trust` is.
+  void cache_process(const process_info& info, winapi::unique_handle process, trust_level trust,
+                     const std::optional<image_identity>& image);
 
   // Called by the gateway's start, before the IPC library starts.
   void set_pipe_security_map(pipe_security_map map) { pipe_security_ = std::move(map); }
+  // Admit only peers whose image path their user cannot change (see
+  // is_protected_image_path). Off unless the configuration asks for it;
+  // set before the IPC library starts.
+  void set_protected_image_paths(bool on) { protected_image_paths_ = on; }
 
   // Processes whose trust is cached (until they exit or are trimmed).
   std::size_t trusted_process_count() const { return trust_cache_.size(); }
@@ -85,7 +104,13 @@ class gateway_observer final : public parlo::ipc::gateway::events {
     task_pool<0> pool;
   };
 
-  bool is_allowed(HANDLE pipe, std::uint32_t pid);
+  bool is_allowed(HANDLE pipe, std::uint32_t pid, bool remote);
+  // untrusted, low_trust or high_trust for a process not in the cache, opened
+  // as `process` (PROCESS_QUERY_LIMITED_INFORMATION); `image` receives the
+  // identity of a file whose verdict this is. Absent when the process
+  // cannot be judged now (nothing is cached then).
+  std::optional<trust_level> classify(const process_info& info, HANDLE process,
+                                      std::optional<image_identity>& image);
   void apply_security(HANDLE pipe);
   std::function<void()> event_task(gateway_event event, HANDLE pipe, std::uint32_t pid = 0,
                                    std::uint32_t err = 0);
@@ -101,4 +126,10 @@ class gateway_observer final : public parlo::ipc::gateway::events {
   pipes_security_descriptor pipes_security_descriptor_;
   processes_trust_cache trust_cache_;
   pipe_security_map pipe_security_;
+  bool protected_image_paths_ = false;
+  // Whether the system tells if a file is the image a process runs.
+  const bool running_image_checked_;
+  // "DENY ALL" is said once for the servers we join: a refused server is
+  // joined again and again.
+  std::atomic<bool> remote_deny_all_said_{false};
 };

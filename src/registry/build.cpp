@@ -165,5 +165,10 @@ std::unique_ptr<gateway> build_gateway(bus& owner, ibus_configuration* provider)
   }
   if (!export_channels(*built, provider)) return nullptr;
   if (!import_channels(*built, provider)) return nullptr;
+  if (auto* policy = static_cast<ibus_trust_policy*>(provider->GetInterface(IID_ibus_trust_policy))) {
+    const bool protected_paths = policy->protected_image_paths_only();
+    logger_stream(level_info, L"build_gateway") << L"protected image paths only=" << (protected_paths ? 1 : 0);
+    built->events().set_protected_image_paths(protected_paths);
+  }
   return built;
 }

@@ -51,7 +51,12 @@ struct local_descriptor_traits {
 };
 using unique_local_descriptor = winapi::unique_any<local_descriptor_traits>;
 
-EXPLICIT_ACCESS_W granting(PSID sid, DWORD mask) {
+static_assert(pipe_client_access == (FILE_GENERIC_READ | FILE_WRITE_DATA | FILE_WRITE_EA | FILE_WRITE_ATTRIBUTES),
+              "what a client of the pipe may do");
+static_assert((pipe_client_access & (FILE_CREATE_PIPE_INSTANCE | WRITE_DAC | WRITE_OWNER | DELETE)) == 0,
+              "a client may not serve the pipe or take it over");
+
+EXPLICIT_ACCESS_W granting(PSID sid, DWORD mask, TRUSTEE_TYPE type = TRUSTEE_IS_WELL_KNOWN_GROUP) {
   EXPLICIT_ACCESS_W entry{};
   entry.grfAccessPermissions = mask;
   entry.grfAccessMode = SET_ACCESS;
@@ -59,9 +64,34 @@ EXPLICIT_ACCESS_W granting(PSID sid, DWORD mask) {
   entry.Trustee.pMultipleTrustee = nullptr;
   entry.Trustee.MultipleTrusteeOperation = NO_MULTIPLE_TRUSTEE;
   entry.Trustee.TrusteeForm = TRUSTEE_IS_SID;
-  entry.Trustee.TrusteeType = TRUSTEE_IS_WELL_KNOWN_GROUP;
+  entry.Trustee.TrusteeType = type;
   entry.Trustee.ptstrName = static_cast<LPWSTR>(sid);
   return entry;
+}
+
+// The user this process runs as, copied out of its token; empty (with a
+// line) when the token cannot be read.
+std::vector<std::uint8_t> token_user_sid() {
+  HANDLE raw_token = nullptr;
+  if (!::OpenProcessToken(::GetCurrentProcess(), TOKEN_QUERY, &raw_token)) {
+    const DWORD error = ::GetLastError();
+    logging::logger_stream(logging::level_error, L"make_pipes_security_descriptor")
+        << L"OpenProcessToken err=" << error;
+    return {};
+  }
+  winapi::unique_handle token(raw_token);
+  DWORD needed = 0;
+  ::GetTokenInformation(token.get(), TokenUser, nullptr, 0, &needed);
+  std::vector<std::uint8_t> buffer(needed == 0 ? sizeof(TOKEN_USER) : needed);
+  if (!::GetTokenInformation(token.get(), TokenUser, buffer.data(), static_cast<DWORD>(buffer.size()), &needed)) {
+    const DWORD error = ::GetLastError();
+    logging::logger_stream(logging::level_error, L"make_pipes_security_descriptor")
+        << L"GetTokenInformation TokenUser err=" << error;
+    return {};
+  }
+  const PSID sid = reinterpret_cast<const TOKEN_USER*>(buffer.data())->User.Sid;
+  const auto* bytes = static_cast<const std::uint8_t*>(sid);
+  return std::vector<std::uint8_t>(bytes, bytes + ::GetLengthSid(sid));
 }
 
 }  // namespace
@@ -70,23 +100,39 @@ pipes_security_descriptor make_pipes_security_descriptor() {
   logging::trace_scope trace(L"make_pipes_security_descriptor");
   constexpr wchar_t function[] = L"make_pipes_security_descriptor";
 
-  // The DACL, in order (SIDs live until SetEntriesInAclW has copied them):
-  //   S-1-1-0       Everyone                  GENERIC_READ | GENERIC_WRITE
-  //   S-1-5-20      Network Service           GENERIC_ALL
-  //   S-1-5-2       Network logon users       GENERIC_ALL
-  //   S-1-16-4096   Low mandatory level       GENERIC_READ | GENERIC_WRITE
-  //   S-1-5-32-544  Administrators            GENERIC_ALL | STANDARD_RIGHTS_REQUIRED
-  //   S-1-15-2-1    All application packages  GENERIC_ALL
+  // The DACL, in order (SIDs live until SetEntriesInAclW has copied them).
+  // The DACL says who may open the pipe, not who is served: admission by
+  // code signature decides that. So every trustee may connect and talk, and
+  // only the few who own the machine or this process may serve the name or
+  // change who may:
+  //   S-1-1-0       Everyone                  pipe_client_access: connect, read, write data
+  //   S-1-5-20      Network Service           pipe_client_access
+  //   S-1-5-2       Network logon users       pipe_client_access
+  //   S-1-16-4096   Low mandatory level       pipe_client_access
+  //   S-1-5-32-544  Administrators            GENERIC_ALL | STANDARD_RIGHTS_REQUIRED: full control
+  //   S-1-15-2-1    All application packages  pipe_client_access
+  //   S-1-5-18      LocalSystem               GENERIC_ALL: full control
+  //   this process's token user               GENERIC_ALL: full control
+  // pipe_client_access is 0x0012019B: FILE_GENERIC_READ (READ_CONTROL,
+  // SYNCHRONIZE, FILE_READ_DATA, FILE_READ_ATTRIBUTES, FILE_READ_EA),
+  // FILE_WRITE_DATA, FILE_WRITE_EA and FILE_WRITE_ATTRIBUTES (a client sets
+  // its read mode with it). It leaves out FILE_CREATE_PIPE_INSTANCE (the
+  // same bit as FILE_APPEND_DATA, part of GENERIC_WRITE), with which a
+  // process may add instances of the name and serve our clients, and
+  // WRITE_DAC, WRITE_OWNER and DELETE, with which it may take the pipe over.
+  // The last two entries exist because adding the next instance of our own
+  // pipe is an access check against this DACL too: the serving process is
+  // often not an administrator, and a service runs as LocalSystem.
   // A SID that cannot be made leaves its entry out; the rest keep their order.
   struct well_known_entry {
     WELL_KNOWN_SID_TYPE type;
     DWORD mask;
   };
   static const well_known_entry well_known[] = {
-      {WinWorldSid, GENERIC_READ | GENERIC_WRITE},
-      {WinNetworkServiceSid, GENERIC_ALL},
-      {WinNetworkSid, GENERIC_ALL},
-      {WinLowLabelSid, GENERIC_READ | GENERIC_WRITE},
+      {WinWorldSid, pipe_client_access},
+      {WinNetworkServiceSid, pipe_client_access},
+      {WinNetworkSid, pipe_client_access},
+      {WinLowLabelSid, pipe_client_access},
   };
   struct string_entry {
     const wchar_t* sid;
@@ -94,11 +140,12 @@ pipes_security_descriptor make_pipes_security_descriptor() {
   };
   static const string_entry from_text[] = {
       {L"S-1-5-32-544", GENERIC_ALL | STANDARD_RIGHTS_REQUIRED},
-      {L"S-1-15-2-1", GENERIC_ALL},
+      {L"S-1-15-2-1", pipe_client_access},
+      {L"S-1-5-18", GENERIC_ALL},
   };
 
   std::vector<EXPLICIT_ACCESS_W> entries;
-  entries.reserve(6);
+  entries.reserve(8);
   std::vector<std::vector<std::uint8_t>> well_known_sids;
   well_known_sids.reserve(std::size(well_known));
   std::vector<unique_local_sid> text_sids;
@@ -114,6 +161,8 @@ pipes_security_descriptor make_pipes_security_descriptor() {
     text_sids.push_back(string_to_sid(e.sid, ignored));
     if (text_sids.back()) entries.push_back(granting(text_sids.back().get(), e.mask));
   }
+  std::vector<std::uint8_t> own_user = token_user_sid();
+  if (!own_user.empty()) entries.push_back(granting(own_user.data(), GENERIC_ALL, TRUSTEE_IS_USER));
 
   PACL raw_acl = nullptr;
   const DWORD set_result = ::SetEntriesInAclW(static_cast<ULONG>(entries.size()), entries.data(),
@@ -173,7 +222,11 @@ bool apply_pipe_security(HANDLE pipe, const pipes_security_descriptor& descripto
         << L"empty security descriptor err=" << static_cast<std::uint32_t>(ERROR_INVALID_PARAMETER);
     return false;
   }
-  const DWORD result = ::SetSecurityInfo(pipe, SE_FILE_OBJECT, flags, /* owner */ nullptr, /* group */ nullptr,
+  // A pipe handle is a kernel object: set exactly this DACL on it. As a file
+  // object, the call would also work out what the pipe file system's root
+  // passes down, which a pipe neither needs nor (under Wine, where it
+  // crashes unless the current DACL is protected) survives.
+  const DWORD result = ::SetSecurityInfo(pipe, SE_KERNEL_OBJECT, flags, /* owner */ nullptr, /* group */ nullptr,
                                          descriptor.dacl, descriptor.sacl);
   if (result != ERROR_SUCCESS) {
     code = winapi::make_win_error(result);

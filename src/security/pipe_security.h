@@ -45,9 +45,16 @@ struct local_free_traits {
 };
 using unique_local_sid = winapi::unique_any<local_free_traits>;
 
-// The DACL of the pipes: read and write for everyone and low integrity
-// processes, full access for network service, network logons,
-// administrators and app containers. Empty on failure.
+// What every trustee of the pipes' DACL may do: connect, read and write data
+// (FILE_GENERIC_READ, FILE_WRITE_DATA, FILE_WRITE_EA, FILE_WRITE_ATTRIBUTES),
+// but neither add instances of the pipe (FILE_CREATE_PIPE_INSTANCE) nor
+// change its security.
+inline constexpr std::uint32_t pipe_client_access = 0x0012019B;
+
+// The DACL of the pipes: pipe_client_access for everyone, network service,
+// network logons, low integrity processes and app containers; full control
+// for administrators, LocalSystem and the user this process runs as. Empty
+// on failure.
 pipes_security_descriptor make_pipes_security_descriptor();
 
 // The security-information flags that apply_pipe_security passes: DACL when
@@ -55,7 +62,8 @@ pipes_security_descriptor make_pipes_security_descriptor();
 std::uint32_t pipe_security_information(const pipes_security_descriptor& descriptor);
 
 // Sets the descriptor's DACL (and SACL, if any) on `pipe`, which must have
-// been opened with WRITE_DAC. True when the system accepted it.
+// been opened with WRITE_DAC. True when the system accepted it. Several
+// threads may stamp pipes at once.
 bool apply_pipe_security(HANDLE pipe, const pipes_security_descriptor& descriptor, std::error_code& code);
 
 // Enables the security privilege in the process token. True also when the

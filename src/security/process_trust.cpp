@@ -1,7 +1,5 @@
 #include "security/process_trust.h"
 
-#include <psapi.h>
-
 #include <iomanip>
 #include <utility>
 
@@ -43,9 +41,10 @@ process_info get_process_info(std::uint32_t pid, HANDLE process) {
   }
   constexpr DWORD path_capacity = 32767;
   std::wstring path(path_capacity, L'\0');
-  const DWORD length = ::K32GetModuleFileNameExW(process, /* module */ nullptr, path.data(), path_capacity);
-  if (length == 0) {
-    winapi::throw_last_error("GetModuleFileNameEx failed");
+  DWORD length = path_capacity;
+  // Flags 0: the Win32 form of the path ("C:\..."), which the file calls take.
+  if (!::QueryFullProcessImageNameW(process, /* flags */ 0, path.data(), &length)) {
+    winapi::throw_last_error("QueryFullProcessImageName failed");
   }
   path.resize(length);
   return process_info{creation, pid, std::filesystem::path(std::move(path))};
@@ -88,12 +87,33 @@ bool signature_checker::check_low_security(const std::wstring& path) {
 }
 
 trust_level signature_checker::get_process_trust(const std::wstring& path) {
-  if (!check_low_security(path)) return trust_level::untrusted;
   std::error_code code;
-  const std::optional<signature> peer = get_signature(path, code);
-  if (code) {
+  const winapi::unique_handle file = open_image(path, code);
+  if (!file) {
+    logging::logger_stream(logging::level_info, L"signature_checker::check_low_security")
+        << L"failed is_trusted for " << std::quoted(path) << L" err=" << code.value();
+    return trust_level::untrusted;
+  }
+  return get_image_trust(file.get(), path);
+}
+
+trust_level signature_checker::get_image_trust(HANDLE file, const std::wstring& path) {
+  const image_verdict verdict = verify_image(file, path);
+  // The lines of check_low_security, as for a verification by path.
+  if (!verdict.trusted) {
+    if (!verdict.code) {
+      logging::logger_stream(logging::level_info, L"signature_checker::check_low_security")
+          << L"not trusted " << std::quoted(path);
+    } else {
+      logging::logger_stream(logging::level_info, L"signature_checker::check_low_security")
+          << L"failed is_trusted for " << std::quoted(path) << L" err=" << verdict.code.value();
+    }
+    return trust_level::untrusted;
+  }
+  const std::optional<signature>& peer = verdict.signer;
+  if (verdict.signer_code) {
     logging::logger_stream(logging::level_warning, L"signature_checker::get_process_trust")
-        << L"get_signature err=" << code.value();
+        << L"get_signature err=" << verdict.signer_code.value();
     return trust_level::low_trust;
   }
   if (!peer) {
@@ -129,6 +149,18 @@ processes_trust_cache::~processes_trust_cache() {
   // low and high maps.
 }
 
+trust_level processes_trust_cache::find_image(const image_identity& image) {
+  std::lock_guard<srw_mutex> lock(mutex_);
+  const auto found = images_.find(image);
+  return found != images_.end() ? found->second.trust : trust_level::unknown;
+}
+
+void processes_trust_cache::release_image_locked(const entry& leaving) {
+  if (!leaving.image) return;
+  const auto found = images_.find(*leaving.image);
+  if (found != images_.end() && --found->second.processes == 0) images_.erase(found);
+}
+
 trust_level processes_trust_cache::find(const process_info& info) {
   std::lock_guard<srw_mutex> lock(mutex_);
   if (high_.count(info) != 0) return trust_level::high_trust;
@@ -150,7 +182,8 @@ processes_trust_cache::map_type* processes_trust_cache::map_for_locked(trust_lev
   }
 }
 
-void processes_trust_cache::add(const process_info& info, winapi::unique_handle process, trust_level trust) {
+void processes_trust_cache::add(const process_info& info, winapi::unique_handle process, trust_level trust,
+                                const std::optional<image_identity>& image) {
   if (!process) {
     // A null handle in the wait list would make every wait fail and end
     // exit monitoring for all cached processes.
@@ -162,7 +195,14 @@ void processes_trust_cache::add(const process_info& info, winapi::unique_handle 
   map_type* map = map_for_locked(trust);
   if (map == nullptr) return;  // `process` closes as it leaves
   trim_locked();
-  map->emplace(info, std::move(process));  // an equal key keeps its entry; ours closes
+  // An equal key keeps its entry; ours closes.
+  const bool inserted = map->emplace(info, entry{std::move(process), image}).second;
+  if (inserted && image) {
+    // A later verdict about the file (it was verified again meanwhile) is
+    // the same as the earlier: the file cannot change while they run.
+    auto& verdict = images_.emplace(*image, image_entry{trust, 0}).first->second;
+    ++verdict.processes;
+  }
   ::SetEvent(wake_event_.get());
 }
 
@@ -171,11 +211,12 @@ void processes_trust_cache::trim_locked() {
   for (map_type* map : {&high_, &low_, &untrusted_}) {
     while (map->size() > trimmed_map_size) {
       auto oldest = map->begin();
+      release_image_locked(oldest->second);
       if (monitoring_) {
         // The wait in progress may include it: the monitoring thread closes
         // it after its next rebuild, which the wake after this insertion
         // brings about.
-        evicted_.push_back(std::move(oldest->second));
+        evicted_.push_back(std::move(oldest->second.process));
       }
       map->erase(oldest);
     }
@@ -185,6 +226,11 @@ void processes_trust_cache::trim_locked() {
 std::size_t processes_trust_cache::size() const {
   std::lock_guard<srw_mutex> lock(mutex_);
   return high_.size() + low_.size() + untrusted_.size();
+}
+
+std::size_t processes_trust_cache::image_count() const {
+  std::lock_guard<srw_mutex> lock(mutex_);
+  return images_.size();
 }
 
 std::size_t processes_trust_cache::count(trust_level trust) const {
@@ -228,11 +274,11 @@ void processes_trust_cache::monitor() {
       handles.clear();
       handles.push_back(stop_event_.get());
       handles.push_back(wake_event_.get());
-      for (const auto& entry : high_) handles.push_back(entry.second.get());
+      for (const auto& cached : high_) handles.push_back(cached.second.process.get());
       low_begin = handles.size();
-      for (const auto& entry : low_) handles.push_back(entry.second.get());
+      for (const auto& cached : low_) handles.push_back(cached.second.process.get());
       untrusted_begin = handles.size();
-      for (const auto& entry : untrusted_) handles.push_back(entry.second.get());
+      for (const auto& cached : untrusted_) handles.push_back(cached.second.process.get());
       // Evicted handles are in no list from now on.
       to_close.swap(evicted_);
       ++wait_rounds_;
@@ -256,7 +302,8 @@ void processes_trust_cache::monitor() {
     std::lock_guard<srw_mutex> lock(mutex_);
     map_type& map = index < low_begin ? high_ : (index < untrusted_begin ? low_ : untrusted_);
     for (auto it = map.begin(); it != map.end(); ++it) {
-      if (it->second.get() == exited) {
+      if (it->second.process.get() == exited) {
+        release_image_locked(it->second);
         map.erase(it);
         break;
       }

@@ -16,6 +16,7 @@
 
 #include "platform/handles.h"
 #include "platform/srw_sync.h"
+#include "security/image_file.h"
 #include "security/signature.h"
 
 enum class trust_level : std::uint32_t { low_trust = 0, high_trust = 1, untrusted = 2, unknown = 3 };
@@ -34,9 +35,11 @@ struct process_info {
 
 bool operator<(const process_info& left, const process_info& right);
 
-// Creation time and image path of `process` (opened with query access).
-// Throws std::system_error ("GetProcessTimes failed", "GetModuleFileNameEx
-// failed") with the Win32 code.
+// Creation time and image path of `process` (opened with
+// PROCESS_QUERY_LIMITED_INFORMATION), both as the kernel records them: the
+// path is not read from the process's own memory, which the process may
+// rewrite. Throws std::system_error ("GetProcessTimes failed",
+// "QueryFullProcessImageName failed") with the Win32 code.
 process_info get_process_info(std::uint32_t pid, HANDLE process);
 
 // Classifies image files against the current process's own signer.
@@ -52,8 +55,12 @@ class signature_checker {
   // True when the file's signature verifies.
   bool check_low_security(const std::wstring& path);
   // untrusted, low_trust or high_trust (same signer name, ASCII case
-  // ignored); never unknown.
+  // ignored); never unknown. Opens the file once (open_image) and classifies
+  // it through that handle; a file that cannot be opened is untrusted.
   trust_level get_process_trust(const std::wstring& path);
+  // The same for a file already open as `file` (`path` names it in lines):
+  // one verification, whose own signer is compared.
+  trust_level get_image_trust(HANDLE file, const std::wstring& path);
 
  private:
   std::optional<signature> current_;
@@ -72,6 +79,14 @@ class signature_checker {
 // Handles that a trim evicts may be part of the wait in progress, so they
 // are not closed on the inserting thread: the monitoring thread closes them
 // once it has rebuilt its wait list without them.
+//
+// Beside the processes, the verdict about each image file (by its identity)
+// that a cached process runs: other processes of the same file are then
+// classified without verifying it again. A file verdict lives exactly as
+// long as a cached process runs that file. While a process runs its image,
+// Windows lets nobody write the file, so the verdict cannot go stale; once
+// the last such process is gone, the file may change in place and the
+// verdict goes with it.
 class processes_trust_cache {
  public:
   static constexpr std::size_t max_handles = MAXIMUM_WAIT_OBJECTS - 2;
@@ -86,11 +101,18 @@ class processes_trust_cache {
   trust_level find(const process_info& info);
   // Stores `process` (SYNCHRONIZE access; the cache takes it) under `info`
   // in the map of `trust`. An equal key already cached keeps its entry and
-  // the new handle is closed; unknown or other values store nothing.
-  void add(const process_info& info, winapi::unique_handle process, trust_level trust);
+  // the new handle is closed; unknown or other values store nothing. With
+  // `image`, `trust` is also the verdict about that file while the process
+  // is cached.
+  void add(const process_info& info, winapi::unique_handle process, trust_level trust,
+           const std::optional<image_identity>& image = std::nullopt);
+  // The verdict about an image file that a cached process runs; unknown
+  // when none does.
+  trust_level find_image(const image_identity& image);
 
   // Read-only views, for diagnostics and tests.
   std::size_t size() const;
+  std::size_t image_count() const;
   std::size_t count(trust_level trust) const;
   // Evicted handles not yet closed by the monitoring thread.
   std::size_t pending_close_count() const;
@@ -100,15 +122,27 @@ class processes_trust_cache {
   std::uint64_t wait_rounds() const;
 
  private:
-  using map_type = std::map<process_info, winapi::unique_handle>;
+  struct entry {
+    winapi::unique_handle process;
+    std::optional<image_identity> image;
+  };
+  using map_type = std::map<process_info, entry>;
+  struct image_entry {
+    trust_level trust;
+    std::size_t processes;  // cached processes that run the file
+  };
 
   void monitor();
   void trim_locked();
   map_type* map_for_locked(trust_level trust);
+  // Forgets a process entry that is leaving its map: its file verdict loses
+  // one process.
+  void release_image_locked(const entry& leaving);
 
   map_type high_;
   map_type low_;
   map_type untrusted_;
+  std::map<image_identity, image_entry> images_;
   mutable srw_mutex mutex_;
   std::thread thread_;
   winapi::unique_handle stop_event_;

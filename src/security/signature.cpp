@@ -87,6 +87,40 @@ std::wstring serial_text(const CRYPT_INTEGER_BLOB& serial) {
   return text;
 }
 
+// The settings every verification uses (see is_trusted), for `file_info`.
+void fill_trust_data(WINTRUST_DATA& data, WINTRUST_FILE_INFO* file_info) {
+  data.cbStruct = wintrust_data_size;
+  data.pPolicyCallbackData = nullptr;
+  data.pSIPClientData = nullptr;
+  data.dwUIChoice = WTD_UI_NONE;
+  data.fdwRevocationChecks = WTD_REVOKE_NONE;
+  data.dwUnionChoice = WTD_CHOICE_FILE;
+  data.pFile = file_info;
+  data.dwStateAction = 0;  // ignore: no state to close afterwards
+  data.hWVTStateData = nullptr;
+  data.pwszURLReference = nullptr;
+  // 0x10 no revocation check, 0x1000 URL retrieval from the cache only: a
+  // verification never waits on the network.
+  data.dwProvFlags = 0x1010;
+  data.dwUIContext = 0;
+}
+
+// The signer record of a certificate; empty and the code on failure.
+signature signer_of(PCCERT_CONTEXT certificate, std::error_code& code) {
+  code = {};
+  if (certificate == nullptr || certificate->pCertInfo == nullptr) {
+    code = winapi::make_win_error(ERROR_INVALID_DATA);
+    return {};
+  }
+  signature result;
+  result.serial_number = serial_text(certificate->pCertInfo->SerialNumber);
+  result.issuer = name_string(certificate, CERT_NAME_ISSUER_FLAG, code);
+  if (code) return {};
+  result.subject = name_string(certificate, 0, code);
+  if (code) return {};
+  return result;
+}
+
 }  // namespace
 
 bool is_trusted(const std::wstring& path, std::error_code& code) {
@@ -99,20 +133,7 @@ bool is_trusted(const std::wstring& path, std::error_code& code) {
   wintrust_data_block block;
   std::memset(&block, 0, sizeof(block));
   WINTRUST_DATA& data = block.data;
-  data.cbStruct = wintrust_data_size;
-  data.pPolicyCallbackData = nullptr;
-  data.pSIPClientData = nullptr;
-  data.dwUIChoice = WTD_UI_NONE;
-  data.fdwRevocationChecks = WTD_REVOKE_NONE;
-  data.dwUnionChoice = WTD_CHOICE_FILE;
-  data.pFile = &file_info;
-  data.dwStateAction = 0;  // ignore: no state to close afterwards
-  data.hWVTStateData = nullptr;
-  data.pwszURLReference = nullptr;
-  // 0x10 no revocation check, 0x1000 URL retrieval from the cache only: a
-  // verification never waits on the network.
-  data.dwProvFlags = 0x1010;
-  data.dwUIContext = 0;
+  fill_trust_data(data, &file_info);
 
   GUID action = WINTRUST_ACTION_GENERIC_VERIFY_V2;
   const LONG result = ::WinVerifyTrust(/* window */ nullptr, &action, &data);
@@ -197,6 +218,64 @@ signature read_signature(const std::wstring& path, std::error_code& code) {
   result.subject = name_string(certificate.get(), 0, code);
   if (code) return {};
   return result;
+}
+
+image_verdict verify_image(HANDLE file, const std::wstring& path) {
+  WINTRUST_FILE_INFO file_info{};
+  file_info.cbStruct = sizeof(WINTRUST_FILE_INFO);
+  file_info.pcwszFilePath = path.c_str();
+  file_info.hFile = file;  // the file as opened, not whatever is at the path now
+  file_info.pgKnownSubject = nullptr;
+
+  wintrust_data_block block;
+  std::memset(&block, 0, sizeof(block));
+  WINTRUST_DATA& data = block.data;
+  fill_trust_data(data, &file_info);
+  // Keep the provider's state: the signer is read from it, then it is closed.
+  data.dwStateAction = WTD_STATEACTION_VERIFY;
+
+  image_verdict verdict;
+  GUID action = WINTRUST_ACTION_GENERIC_VERIFY_V2;
+  // The provider's state is closed however this function leaves.
+  struct state_closer {
+    WINTRUST_DATA& data;
+    GUID& action;
+    ~state_closer() {
+      if (data.hWVTStateData == nullptr) return;
+      data.dwStateAction = WTD_STATEACTION_CLOSE;
+      ::WinVerifyTrust(/* window */ nullptr, &action, &data);
+    }
+  } closer{data, action};
+  const LONG result = ::WinVerifyTrust(/* window */ nullptr, &action, &data);
+  switch (static_cast<DWORD>(result)) {
+    case 0:
+      verdict.trusted = true;
+      break;
+    case trust_e_subject_not_trusted:
+    case trust_e_nosignature:
+      break;
+    default:
+      verdict.code = winapi::make_win_error(static_cast<std::uint32_t>(result));
+      break;
+  }
+  if (verdict.trusted) {
+    CRYPT_PROVIDER_DATA* provider = ::WTHelperProvDataFromStateData(data.hWVTStateData);
+    CRYPT_PROVIDER_SGNR* signer =
+        provider != nullptr ? ::WTHelperGetProvSignerFromChain(provider, /* signer */ 0, /* counter_signer */ FALSE,
+                                                               /* counter_index */ 0)
+                            : nullptr;
+    if (signer == nullptr || signer->csCertChain == 0 || signer->pasCertChain == nullptr) {
+      verdict.signer_code = winapi::make_win_error(ERROR_NOT_FOUND);
+    } else {
+      signature record = signer_of(signer->pasCertChain[0].pCert, verdict.signer_code);
+      if (!verdict.signer_code) verdict.signer = std::move(record);
+    }
+    if (verdict.signer_code) {
+      logging::logger_stream(logging::level_warning, L"get_signature")
+          << L"get_signature err=0x" << verdict.signer_code.value() << L" " << verdict.signer_code.message();
+    }
+  }
+  return verdict;
 }
 
 std::optional<signature> get_signature(const std::wstring& path, std::error_code& code) {

@@ -6,6 +6,8 @@
 // System failures never throw: they travel as Win32-category error codes.
 #pragma once
 
+#include <windows.h>
+
 #include <optional>
 #include <string>
 #include <system_error>
@@ -38,3 +40,23 @@ std::optional<signature> get_signature(const std::wstring& path, std::error_code
 // The signer of the current process's own image; absent on any failure (the
 // reason is only in the log).
 std::optional<signature> get_current_signature();
+
+// What one verification of an open image file found. The signer is taken
+// from that same verification (the certificate that signed what was
+// verified), so the verdict and the signer are about one file even when
+// somebody replaces the file at its path meanwhile.
+struct image_verdict {
+  // The embedded signature verifies (the same settings as is_trusted).
+  bool trusted = false;
+  // A failure of verification other than "unsigned" or "not trusted".
+  std::error_code code;
+  // When trusted: the signer, or absent with `signer_code` when it cannot be
+  // read from the verification.
+  std::optional<signature> signer;
+  std::error_code signer_code;
+};
+
+// Verifies the image open as `file` (read access; `path` names it for the
+// system and the lines) and reads its signer from that verification. Writes
+// the "get_signature err=0x" warning when the signer cannot be read.
+image_verdict verify_image(HANDLE file, const std::wstring& path);

@@ -218,8 +218,14 @@ TEST_F(bus_test, names_and_tables_too_large_for_one_message_are_refused_with_87)
 }
 
 // Additions before removals; an empty list empties the process's entry; a
-// list carrying this process's own id is ignored.
+// list carrying this process's own id is ignored, and so is one of a process
+// that no connection carries.
 TEST_F(bus_test, remote_lists_are_merged_and_this_processs_own_ignored) {
+  publish_as(other_pid + 4, {{"a", "x"}});
+  EXPECT_TRUE(settle().empty());
+  EXPECT_TRUE(test_support::has_line(L"bus::on_remote_listeners", L"pid=4246 dropped: no connection from that process"));
+  b.on_local_connect("\\pipe", other_pid);
+  settle();
   const std::pair<listener_list, notifications> steps[] = {
       {{{"a", "x"}, {"c", "z"}}, {added(other_pid, "a", "x"), added(other_pid, "c", "z")}},
       {{{"a", "x"}, {"b", "y"}}, {added(other_pid, "b", "y"), removed(other_pid, "c", "z")}},
@@ -232,7 +238,7 @@ TEST_F(bus_test, remote_lists_are_merged_and_this_processs_own_ignored) {
   }
   EXPECT_TRUE(b.is_registered_listener("d", "w")) << "a remote listener counts";
   publish_as(own, {{"a", "x"}});
-  b.on_remote_listeners(own, {{"b", "y"}});
+  b.on_remote_listeners(own, {{"b", "y"}}, own);
   EXPECT_TRUE(settle().empty());
   EXPECT_FALSE(b.is_registered_listener("a", "x") || b.is_registered_listener("b", "y"));
 }

@@ -28,7 +28,7 @@ TEST_F(e2e_test, admission_depends_on_the_peers_signer_and_the_pipes_level) {
 
   // Another signer: refused where only our signer may come, admitted on the
   // pipe that takes any valid signer.
-  auto other = start_host("host_b", "peer_b", host_config({level0, level1}));
+  auto other = start_host("host_b", "peer_b", host_config({level0, level1}, {}, 1));
   ASSERT_TRUE(other->ready()) << other->output();
   other->send("register alerts b1");
   EXPECT_TRUE(us.observer.wait_has(other->pid(), "b1"));

@@ -6,6 +6,7 @@
 #pragma once
 
 #include <windows.h>
+#include <psapi.h>
 
 #include <gtest/gtest.h>
 
@@ -173,16 +174,53 @@ class host_process {
   bool ready_ = false;
 };
 
+// Wine 8 leaves PrivateUsage at 0 and fills PagefileUsage with the process's
+// anonymous resident memory.
+inline long long private_bytes() {
+  PROCESS_MEMORY_COUNTERS_EX counters{};
+  ::GetProcessMemoryInfo(::GetCurrentProcess(), reinterpret_cast<PROCESS_MEMORY_COUNTERS*>(&counters),
+                         sizeof(counters));
+  return static_cast<long long>(counters.PrivateUsage != 0 ? counters.PrivateUsage : counters.PagefileUsage);
+}
+
+// The bytes of every block in use in every heap of this process. Unlike the
+// resident memory, freed blocks that a heap keeps for later do not count, so
+// what a burst of large messages leaves behind reads the same from run to run.
+inline long long heap_bytes_in_use() {
+  std::vector<HANDLE> heaps(64);
+  DWORD count = ::GetProcessHeaps(static_cast<DWORD>(heaps.size()), heaps.data());
+  if (count > heaps.size()) {
+    heaps.resize(count + 16);
+    count = ::GetProcessHeaps(static_cast<DWORD>(heaps.size()), heaps.data());
+  }
+  heaps.resize(std::min<std::size_t>(count, heaps.size()));
+  long long total = 0;
+  for (HANDLE heap : heaps) {
+    if (!::HeapLock(heap)) continue;
+    PROCESS_HEAP_ENTRY entry{};
+    while (::HeapWalk(heap, &entry)) {
+      if ((entry.wFlags & PROCESS_HEAP_ENTRY_BUSY) != 0) total += entry.cbData;
+    }
+    ::HeapUnlock(heap);
+  }
+  return total;
+}
+
 // A vorbel_host configuration of bus "main" and its channel "alerts",
-// imported over each pipe of `imports` and exported on each (pipe, level).
-inline std::string host_config(const std::vector<std::string>& imports, const pipes& exports = {}) {
+// imported over each pipe of `imports` (admitting a server at
+// `import_level`) and exported on each (pipe, level).
+inline std::string host_config(const std::vector<std::string>& imports, const pipes& exports = {},
+                               std::uint32_t import_level = 0) {
   auto add = [](std::string& list, std::string pipe, const std::string& rest) {
     for (std::size_t at = 0; (at = pipe.find('\\', at)) != std::string::npos; at += 2) pipe.insert(at, "\\");
     list += (list.empty() ? "{\"channel\": \"alerts\", \"pipe\": \"" : ", {\"channel\": \"alerts\", \"pipe\": \"") +
             pipe + "\", " + rest + "}";
   };
   std::string in, out;
-  for (const auto& pipe : imports) add(in, pipe, "\"remote_channel\": \"alerts\", \"remote_bus\": \"main\"");
+  for (const auto& pipe : imports) {
+    add(in, pipe, "\"remote_channel\": \"alerts\", \"remote_bus\": \"main\", \"security\": " +
+                      std::to_string(import_level));
+  }
   for (const auto& [pipe, level] : exports) add(out, pipe, "\"security\": " + std::to_string(level));
   return "{\"bus\": \"main\", \"local_channels\": [\"alerts\"], \"imported_channels\": [" + in +
          "], \"exported_channels\": [" + out + "]}";
@@ -266,14 +304,17 @@ class table_observer final : public ibus_observer {
 };
 
 // This process as a peer: bus "main" with channel "alerts" exported on each
-// (pipe, level), imported over each pipe of `imports`, and its listener
-// `listener`.
+// (pipe, level), imported over each pipe of `imports` (admitting a server at
+// `import_level`), and its listener `listener`; with `protected_image_paths`
+// it admits only peers whose image path their user cannot change.
 class this_process {
  public:
-  this_process(const pipes& exports, const std::vector<std::string>& imports, const char* listener) {
+  this_process(const pipes& exports, const std::vector<std::string>& imports, const char* listener,
+               std::uint32_t import_level = 0, bool protected_image_paths = false) {
     provider_.local = {"alerts"};
+    provider_.protected_image_paths = protected_image_paths;
     for (const auto& [pipe, level] : exports) provider_.exports.push_back({"alerts", pipe, true, 3, level});
-    for (const auto& pipe : imports) provider_.imports.push_back({"alerts", pipe, "alerts", "main"});
+    for (const auto& pipe : imports) provider_.imports.push_back({"alerts", pipe, "alerts", "main", import_level});
     bus_ = registry_.create_bus("main", &provider_);
     registered_ = bus_ && bus_->add_observer(&observer, 0) && bus_->register_listener("alerts", listener) == 0;
   }

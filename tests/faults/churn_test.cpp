@@ -36,14 +36,6 @@ DWORD handle_count() {
   }
   return count;
 }
-// Wine 8 leaves PrivateUsage at 0 and fills PagefileUsage with the process's
-// anonymous resident memory.
-long long private_bytes() {
-  PROCESS_MEMORY_COUNTERS_EX counters{};
-  ::GetProcessMemoryInfo(::GetCurrentProcess(), reinterpret_cast<PROCESS_MEMORY_COUNTERS*>(&counters),
-                         sizeof(counters));
-  return static_cast<long long>(counters.PrivateUsage != 0 ? counters.PrivateUsage : counters.PagefileUsage);
-}
 
 class churn_test : public ::testing::Test {
  protected:
@@ -133,7 +125,7 @@ TEST_F(churn_test, seventy_peers_at_once_are_all_classified_and_answered) {
   constexpr int all = 70;
   std::vector<std::unique_ptr<host_process>> peers(all);
   auto start_peer = [&](int i, const char* image, const std::string& pipe) {
-    peers[i] = start_host(image, "many" + std::to_string(i), host_config({pipe}));
+    peers[i] = start_host(image, "many" + std::to_string(i), host_config({pipe}, {}, /* import_level */ 1));
     peers[i]->send("register alerts p" + std::to_string(i));
   };
   const auto start = clock::now();

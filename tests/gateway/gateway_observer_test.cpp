@@ -101,7 +101,7 @@ TEST_F(gateway_observer_test, admission_follows_trust_and_level_first_and_cached
     }
   }
   unique_local_sid holder;
-  EXPECT_EQ(6u, security_test::dacl_of(level0.get(), holder)->AceCount) << "the admitted get the component's DACL";
+  EXPECT_EQ(8u, security_test::dacl_of(level0.get(), holder)->AceCount) << "the admitted get the component's DACL";
 
   child_process ours(image_path(L"child_a"));
   EXPECT_FALSE(connect(unlisted, ours.pid()));
@@ -115,7 +115,10 @@ TEST_F(gateway_observer_test, the_unsigned_build_refuses_every_local_connection)
   child_process ours(image_path(L"child_a"));
   EXPECT_FALSE(connect(level0, ours.pid()));
   EXPECT_TRUE(has_line(L"gateway_observer::is_allowed", L"current process signature is invalid => DENY ALL"));
-  EXPECT_TRUE(sink.on_remote_connect(level0.get(), ours.pid())) << "remote connections are unaffected";
+  // Nor does it join any server, and says so once, however often it tries.
+  EXPECT_FALSE(sink.on_remote_connect(level0.get(), ours.pid()));
+  EXPECT_FALSE(sink.on_remote_connect(level0.get(), ours.pid()));
+  EXPECT_EQ(2u, find_lines(L"gateway_observer::is_allowed", L"DENY ALL").size());
 }
 
 }  // namespace

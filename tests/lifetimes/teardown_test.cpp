@@ -50,7 +50,7 @@ TEST(teardown, a_long_notification_task_stops_when_its_bus_is_destroyed) {
   listener_list received;
   for (int i = 0; i < 5000; ++i) received.push_back({"alerts", std::to_string(100000 + i)});
   observer.armed = true;
-  doomed->on_remote_listeners(4242, std::move(received));
+  doomed->on_remote_listeners(4242, std::move(received), /* origin */ 4242);
   ASSERT_TRUE(observer.entered.wait());
   bounded_thread destroyer([&] { delete doomed; });
   ::Sleep(100);

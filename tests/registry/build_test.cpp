@@ -8,6 +8,7 @@
 
 #include "registry/vorbel_impl.h"
 #include "support/config_provider.h"
+#include "support/log_capture.h"
 
 namespace {
 
@@ -45,6 +46,28 @@ TEST(build, exports_are_probed_then_enumerated_from_the_start_and_each_pipe_carr
       take_ipc_calls());
   registry.destroy_bus("exporter");
   EXPECT_EQ("stop\ndestroy\n", take_ipc_calls());
+}
+
+// Levels 0 and 1 are the only ones: any other is refused where it is
+// configured, before it reaches the IPC library, and the bus goes without a
+// gateway rather than with a pipe that admission would treat one way on
+// first contact and another from its cache.
+TEST(build, a_pipe_security_level_other_than_0_or_1_is_refused_with_a_line) {
+  take_ipc_calls();
+  vorbel_impl registry;
+  test_support::config_provider exporter, importer;
+  exporter.exports = {{"orders", "\\\\.\\pipe\\p2", true, 3, 2}};
+  importer.imports = {{"local", "pipe_c", "remote", "remote_bus", 7}};
+  for (auto [provider, name] : {std::pair{&exporter, "level2"}, std::pair{&importer, "level7"}}) {
+    SCOPED_TRACE(name);
+    test_support::clear_log();
+    ASSERT_NE(nullptr, registry.create_bus(name, provider));
+    EXPECT_EQ(nullptr, registry.get_gateway(name));
+    EXPECT_EQ("create bus\ndestroy\n", take_ipc_calls());
+    EXPECT_EQ(1u, test_support::find_lines(L"", L"is no pipe security level (0 or 1)").size())
+        << test_support::dump_log();
+    registry.destroy_bus(name);
+  }
 }
 
 }  // namespace

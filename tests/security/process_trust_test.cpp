@@ -114,4 +114,36 @@ TEST_F(trust_cache_test, eviction_during_a_wait_never_breaks_the_wait) {
   }
 }
 
+// A file's verdict holds while a cached process runs the file (the file
+// cannot change then) and goes with the last of them, however it leaves:
+// exit, trim, or a second add of a process already cached, which must not
+// count twice.
+TEST_F(trust_cache_test, an_image_verdict_lives_exactly_while_a_cached_process_runs_the_image) {
+  fake_processes p(65);
+  processes_trust_cache cache;
+  image_identity file;
+  file.size = 4096;
+  file.file_id[0] = 7;
+  image_identity rewritten = file;
+  rewritten.last_write = 1;
+  cache.add(key(0), p.duplicate(0), trust_level::low_trust, file);
+  cache.add(key(1), p.duplicate(1), trust_level::low_trust, file);
+  cache.add(key(1), p.duplicate(1), trust_level::low_trust, file);  // already cached
+  EXPECT_EQ(cache.find_image(file), trust_level::low_trust);
+  EXPECT_EQ(cache.find_image(rewritten), trust_level::unknown);
+  ::SetEvent(p.events[0].get());
+  ASSERT_TRUE(p.gone(cache, 0));
+  EXPECT_EQ(cache.find_image(file), trust_level::low_trust) << "process 1 still runs it";
+  ::SetEvent(p.events[1].get());
+  ASSERT_TRUE(p.gone(cache, 1));
+  EXPECT_TRUE(wait_until([&] { return cache.find_image(file) == trust_level::unknown; }));
+
+  // The oldest process, the only one of the file, is trimmed away.
+  cache.add(key(2), p.duplicate(2), trust_level::high_trust, file);
+  for (std::size_t i = 3; i < 65; ++i) p.add(cache, i, trust_level::high_trust);  // the 63rd trims
+  EXPECT_EQ(cache.find(key(2)), trust_level::unknown);
+  EXPECT_EQ(cache.find_image(file), trust_level::unknown);
+  EXPECT_EQ(cache.image_count(), 0u);
+}
+
 }  // namespace

@@ -24,11 +24,14 @@ struct imported {
   std::string pipe;
   std::string remote_channel;
   std::string remote_bus;
+  std::uint32_t security = 0;
 };
 
-class config_provider final : public ibus_configuration {
+class config_provider final : public ibus_configuration, public ibus_trust_policy {
  public:
   bool is_default = false;
+  // When true the provider offers ibus_trust_policy asking for it.
+  bool protected_image_paths = false;
   std::vector<std::string> local;
   std::vector<exported> exports;
   std::vector<imported> imports;
@@ -36,7 +39,11 @@ class config_provider final : public ibus_configuration {
   int default_asked = 0;            // is_default_bus calls
   std::string exported_cursors;     // the cursor of each next_exported_channel call, a digit each
 
-  void* GetInterface(GUID) override { return nullptr; }
+  void* GetInterface(GUID iid) override {
+    return protected_image_paths && qm::same_iid(iid, IID_ibus_trust_policy) ? static_cast<ibus_trust_policy*>(this)
+                                                                             : nullptr;
+  }
+  bool protected_image_paths_only() override { return protected_image_paths; }
 
   bool is_default_bus() override {
     ++default_asked;
@@ -73,7 +80,7 @@ class config_provider final : public ibus_configuration {
     *remote_channel_name = i.remote_channel.c_str();
     *remote_bus_name = i.remote_bus.c_str();
     *link_type = 3;
-    *security = 0;
+    *security = i.security;
     return true;
   }
 };

@@ -109,7 +109,8 @@ bus_config parse_configuration(const std::string& json_text) {
                                root.type_name());
   }
   check_known_fields(root, "",
-                     {"bus", "default", "local_channels", "exported_channels", "imported_channels"});
+                     {"bus", "default", "protected_image_paths", "local_channels", "exported_channels",
+                      "imported_channels"});
 
   bus_config config;
   if (const auto it = root.find("bus"); it != root.end()) config.bus = name_value(*it, "bus");
@@ -118,6 +119,12 @@ bus_config parse_configuration(const std::string& json_text) {
       throw config_error("default", std::string("must be true or false, found ") + it->dump());
     }
     config.is_default = it->get<bool>();
+  }
+  if (const auto it = root.find("protected_image_paths"); it != root.end()) {
+    if (!it->is_boolean()) {
+      throw config_error("protected_image_paths", std::string("must be true or false, found ") + it->dump());
+    }
+    config.protected_image_paths = it->get<bool>();
   }
 
   const json empty = json::array();
@@ -201,8 +208,12 @@ bus_config load_configuration(const std::wstring& path) {
 }
 
 void* json_configuration::GetInterface(GUID iid) {
-  return qm::same_iid(iid, IID_IQmBaseInterface) ? static_cast<IQmBaseInterface*>(this) : nullptr;
+  if (qm::same_iid(iid, IID_IQmBaseInterface)) return static_cast<ibus_configuration*>(this);
+  if (qm::same_iid(iid, IID_ibus_trust_policy)) return static_cast<ibus_trust_policy*>(this);
+  return nullptr;
 }
+
+bool json_configuration::protected_image_paths_only() { return config_.protected_image_paths; }
 
 bool json_configuration::is_default_bus() { return config_.is_default; }
 

@@ -38,6 +38,8 @@ struct imported_channel {
 struct bus_config {
   std::optional<std::string> bus;
   bool is_default = false;
+  // Admit only peers whose image path their user cannot change.
+  bool protected_image_paths = false;
   std::vector<std::string> local_channels;
   std::vector<exported_channel> exported_channels;
   std::vector<imported_channel> imported_channels;
@@ -63,11 +65,12 @@ bus_config parse_configuration(const std::string& json_text);
 // cannot be read, is too large, or is not a valid configuration).
 bus_config load_configuration(const std::wstring& path);
 
-class json_configuration final : public ibus_configuration {
+class json_configuration final : public ibus_configuration, public ibus_trust_policy {
  public:
   explicit json_configuration(const bus_config& config) : config_(config) {}
 
   void* GetInterface(GUID iid) override;
+  bool protected_image_paths_only() override;
   bool is_default_bus() override;
   bool next_local_channel(std::uint64_t* cursor, const char** channel_name) override;
   bool next_exported_channel(std::uint64_t* cursor, const char** channel_name,

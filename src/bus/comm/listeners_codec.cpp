@@ -65,6 +65,10 @@ listener_list read_listeners(const std::uint8_t* data) {
   return received;
 }
 
+std::size_t count_listeners(const std::uint8_t* data) {
+  return wire::Getlisteners_message(data)->listeners()->size();
+}
+
 bool decode_listeners(const std::uint8_t* data, std::size_t size, std::uint32_t& pid,
                       listener_list& listeners) {
   std::uint32_t read_pid = 0;

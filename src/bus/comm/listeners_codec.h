@@ -65,6 +65,10 @@ bool verify_listeners(const std::uint8_t* data, std::size_t size, std::uint32_t&
 // order.
 listener_list read_listeners(const std::uint8_t* data);
 
+// How many listeners a buffer that verify_listeners accepted holds, without
+// reading them.
+std::size_t count_listeners(const std::uint8_t* data);
+
 // Both steps: false (and `listeners` untouched) when verification refuses.
 bool decode_listeners(const std::uint8_t* data, std::size_t size, std::uint32_t& pid,
                       listener_list& listeners);

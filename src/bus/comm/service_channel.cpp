@@ -18,6 +18,20 @@ using logging::logger_stream;
 
 constexpr const char* params_blob = listeners_blob_name;
 
+// The process a message came from, when the IPC library delivered it from a
+// pipe: 0 for a message posted in this process (or by a library that cannot
+// say). A blob of another size is no origin the library wrote.
+bool read_origin(parlo::message* message, std::uint32_t& origin) {
+  std::uint64_t size = 0;
+  const auto* bytes = static_cast<const std::uint8_t*>(message->get_blob(parlo::ipc::origin_pid_blob, &size));
+  origin = 0;
+  if (bytes == nullptr) return true;
+  if (size != 4) return false;
+  origin = static_cast<std::uint32_t>(bytes[0]) | (static_cast<std::uint32_t>(bytes[1]) << 8) |
+           (static_cast<std::uint32_t>(bytes[2]) << 16) | (static_cast<std::uint32_t>(bytes[3]) << 24);
+  return true;
+}
+
 void on_service_message(parlo::message* message, void* context) {
   if (message == nullptr || context == nullptr) return;
   static_cast<service_channel*>(context)->on_message(message);
@@ -186,8 +200,23 @@ void service_channel::on_message(parlo::message* message) try {
   // This process's own publication comes back on its own subscription; it is
   // dropped before the list is built.
   if (pid == own_pid_) return;
+  // A peer speaks for itself only: the pid in the list is what it claims,
+  // the origin is what the system said about its connection.
+  std::uint32_t origin = 0;
+  if (!read_origin(message, origin) || (origin != 0 && origin != pid)) {
+    logger_stream(logging::level_warning, L"comm::service_channel::on_message")
+        << L"listeners message of pid=" << pid << L" refused: it came from pid=" << origin;
+    return;
+  }
+  const std::size_t count = count_listeners(data);
+  if (count > max_listeners_per_process) {
+    logger_stream(logging::level_warning, L"comm::service_channel::on_message")
+        << L"listeners message of pid=" << pid << L" refused: " << count << L" listeners, more than "
+        << max_listeners_per_process << L" per process";
+    return;
+  }
   try {
-    observer_->on_remote_listeners(pid, read_listeners(data));
+    observer_->on_remote_listeners(pid, read_listeners(data), origin);
   } catch (const std::exception& e) {
     logger_stream(level_error, L"comm::service_channel::on_message")
         << L"listeners message of pid=" << pid << L" dropped: " << e.what();

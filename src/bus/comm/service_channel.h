@@ -34,6 +34,12 @@ constexpr const char* listeners_blob_name = "params";
 constexpr std::uint64_t max_listeners_message_size =
     parlo::max_message_size - std::char_traits<char>::length(listeners_blob_name);
 
+// Most listeners taken from one process: a larger list is refused with a
+// line (the connection stays, and the process's earlier list with it), so
+// that a peer cannot make this process hold more than this many of its
+// listeners. At a few hundred bytes per listener, a few MiB per peer.
+constexpr std::size_t max_listeners_per_process = 16384;
+
 enum class service_channel_messages_id : std::uint32_t {
   publish_listeners = 1,  // no content: asks every receiver to publish
   listeners = 2,          // blob "params": the listeners message
@@ -44,7 +50,10 @@ struct iservice_channel_observer {
   // A process asked for this process's listeners.
   virtual std::uint32_t on_listeners_requested() = 0;
   // A process published its listeners; the list is the observer's.
-  virtual void on_remote_listeners(const std::uint32_t& pid, listener_list listeners) = 0;
+  // `origin` is `pid` when the IPC library delivered the list from that
+  // process's connection (which it had admitted), 0 when nobody said where
+  // it came from.
+  virtual void on_remote_listeners(const std::uint32_t& pid, listener_list listeners, std::uint32_t origin) = 0;
 
  protected:
   ~iservice_channel_observer() = default;
@@ -73,6 +82,10 @@ class service_channel {
   // Asks every process on the channel to publish its listeners.
   std::uint32_t request_remote_listeners();
 
+  // A listeners message is taken only under the pid of the process it came
+  // from, when the messaging library says which (the IPC library's origin
+  // blob); one whose pid differs, or over max_listeners_per_process, is
+  // refused with a warning.
   void on_message(parlo::message* message);
 
   bool subscribed() const { return subscription_ != nullptr; }

@@ -7,6 +7,17 @@
 // library calls the sink from its own threads, possibly several at once, from
 // create_gateway on and never after destroy_gateway has returned. Pipe
 // handles stay the library's; the component never closes them.
+//
+// Several connect events may run at once, also on one pipe: an admission
+// that takes long (a large image to verify) holds back no other connection.
+//
+// Origin of delivered messages: every message the library delivers from a
+// pipe carries the blob origin_pid_blob, 4 bytes, little-endian: the id of
+// the process at the other end of that connection as the system reports it
+// (the client's on a served pipe, the server's on an opened one), set by the
+// receiving library whatever the sender put under that name. Messages posted
+// in this process never carry it. A message that cannot take the blob (it is
+// at the messaging library's limits) is not delivered.
 #pragma once
 
 #include <cstdint>
@@ -19,6 +30,9 @@ namespace parlo::ipc {
 
 // A pipe's Win32 handle.
 using pipe_handle = void*;
+
+// The blob naming the process a delivered message came from (see above).
+inline constexpr const char* origin_pid_blob = "parlo_ipc.origin_pid";
 
 class gateway {
  public:
