@@ -117,10 +117,13 @@ std::uint32_t bus::register_listener(const char* channel, const char* id) try {
   }
   const std::uint64_t adds = comm::listener_encoded_bound(channel_size, id_size);
   std::uint64_t table_bytes = 0;
+  std::size_t table_count = 0;
   {
     std::unique_lock<srw_mutex> lock(mutex_);
     table_bytes = own_bytes_;
-    if (table_bytes + adds <= comm::max_listeners_message_size) {
+    table_count = own_count_;
+    if (table_bytes + adds <= comm::max_listeners_message_size &&
+        table_count < comm::max_listeners_per_process) {
       // Everything that may run out of memory comes before the first
       // change: the table, its notification and the publisher's list of
       // changes must not disagree.
@@ -135,6 +138,7 @@ std::uint32_t bus::register_listener(const char* channel, const char* id) try {
         throw;
       }
       ++entry->second;
+      ++own_count_;
       own_bytes_ += adds;
       log_change_locked(std::move(change));
       lock.unlock();
@@ -145,11 +149,16 @@ std::uint32_t bus::register_listener(const char* channel, const char* id) try {
       return 0;
     }
   }
-  // Accepted, it could never be published: every later change of this
-  // process's table would be lost on its peers with it.
-  logger_stream(level_error, L"bus::register_listener")
-      << L"listener refused: the table would take more than " << comm::max_listeners_message_size
-      << L" bytes in one message (" << table_bytes << L" now, " << adds << L" more)";
+  // Accepted, it could never be published, or its peers would refuse the
+  // table: every later change of this process's table would be lost on them.
+  logger_stream line(level_error, L"bus::register_listener");
+  if (table_count >= comm::max_listeners_per_process) {
+    line << L"listener refused: this process has " << table_count
+         << L" listeners, the most its peers take from one process";
+  } else {
+    line << L"listener refused: the table would take more than " << comm::max_listeners_message_size
+         << L" bytes in one message (" << table_bytes << L" now, " << adds << L" more)";
+  }
   return ERROR_INVALID_PARAMETER;
 } catch (...) {
   logging::log_current_exception(L"bus::register_listener");
@@ -174,6 +183,7 @@ std::uint32_t bus::unregister_listener(const char* channel, const char* id) try 
   reserve_change_locked();
   post_listener_removed(notifier_, observer_list_, pid_, change.item);
   own_bytes_ -= comm::listener_encoded_bound(change.item.channel.size(), change.item.id.size());
+  --own_count_;
   if (--found->second == 0) own_.erase(found);
   log_change_locked(std::move(change));
   lock.unlock();

@@ -132,13 +132,15 @@ class bus final : public qm::observable<ibus_observer_base*, ibus>,
   task_pool<0> notifier_;
   // This process's listeners with their counts, found by hash so that a
   // registration costs the same however large the table; an upper bound of
-  // their encoded size (a registration that would take the message beyond
-  // what the messaging library carries is refused); and the changes the
+  // their encoded size and their number (a registration that would take the
+  // message beyond what the messaging library carries, or the table beyond
+  // what peers take from one process, is refused); and the changes the
   // publisher has not taken yet, in order. A removal right after the same
   // listener's addition cancels it in place, so a host that registers and
   // removes a listener again and again leaves no trail.
   std::unordered_map<listener, std::size_t, listener_hash> own_;
   std::uint64_t own_bytes_ = comm::listeners_fixed_bound;
+  std::size_t own_count_ = 0;
   std::vector<own_change> own_changes_;
   // False once it is clear that nothing will take the changes (no service
   // channel, or unsubscribed): they are then not kept.

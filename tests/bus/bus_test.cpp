@@ -199,6 +199,14 @@ TEST_F(bus_test, names_and_tables_too_large_for_one_message_are_refused_with_87)
     EXPECT_TRUE(test_support::has_line(L"bus::register_listener", r.line)) << test_support::dump_log();
     EXPECT_FALSE(b.is_registered_listener(r.channel.c_str(), r.id.c_str()));
   }
+  // No more listeners than a peer takes from one process: it would refuse
+  // the whole table.
+  for (std::size_t i = 0; i < comm::max_listeners_per_process; ++i) {
+    ASSERT_EQ(0u, b.register_listener("n", std::to_string(i).c_str())) << i;
+  }
+  EXPECT_EQ(87u, b.register_listener("n", "one more"));
+  EXPECT_TRUE(test_support::has_line(L"bus::register_listener", L"listener refused: this process has 16384 listeners"));
+  for (std::size_t i = 0; i < comm::max_listeners_per_process; ++i) b.unregister_listener("n", std::to_string(i).c_str());
   // The longest ids the bus takes, until the table is full.
   std::string id(ibus_max_listener_name, 'i');
   std::size_t accepted = 0;
@@ -207,7 +215,7 @@ TEST_F(bus_test, names_and_tables_too_large_for_one_message_are_refused_with_87)
     if (b.register_listener("c", id.c_str()) != 0) break;
   }
   EXPECT_TRUE(test_support::has_line(L"bus::register_listener",
-                                     L"listener refused: the table would take more than 16777210 bytes in one message"));
+                                     L"listener refused: the table would take more than 16777186 bytes in one message"));
   EXPECT_GT(accepted, 250u);
   EXPECT_EQ(0u, b.register_listener("small", "1")) << "a listener that fits is still taken";
   settle();

@@ -17,27 +17,27 @@
 
 #include "bus/listener.h"
 #include "bus/parlo/parlo.h"
+#include "gateway/parlo_ipc/parlo_ipc.h"
 
 struct ibus;
-
-namespace parlo::ipc {
-class gateway;
-}
 
 namespace comm {
 
 constexpr const char* service_channel_name = "vorbel_service";
 // The blob of a listeners message, and the largest message it can hold: the
 // messaging library carries at most parlo::max_message_size bytes of blobs
-// in one message, their names included.
+// in one message, their names included, and the receiving IPC library adds
+// the origin blob (4 bytes under its name) to every message from a pipe.
 constexpr const char* listeners_blob_name = "params";
 constexpr std::uint64_t max_listeners_message_size =
-    parlo::max_message_size - std::char_traits<char>::length(listeners_blob_name);
+    parlo::max_message_size - std::char_traits<char>::length(listeners_blob_name) -
+    (std::char_traits<char>::length(parlo::ipc::origin_pid_blob) + 4);
 
 // Most listeners taken from one process: a larger list is refused with a
 // line (the connection stays, and the process's earlier list with it), so
 // that a peer cannot make this process hold more than this many of its
-// listeners. At a few hundred bytes per listener, a few MiB per peer.
+// listeners. At a few hundred bytes per listener, a few MiB per peer. A bus
+// registers no more than this itself: its peers would refuse its table.
 constexpr std::size_t max_listeners_per_process = 16384;
 
 enum class service_channel_messages_id : std::uint32_t {
