@@ -50,7 +50,8 @@ std::wstring reason_text(const admission_facts& facts);
 void write_admission_line(const admission_facts& facts);
 
 // The facts as the public struct sees them, with copies of the strings.
-// Not copyable: the view points into the record's own strings.
+// Immutable once built, so any thread may read it; not copyable: the view
+// points into the record's own strings. Shared by the tasks that deliver it.
 class admission_record {
  public:
   explicit admission_record(const admission_facts& facts);

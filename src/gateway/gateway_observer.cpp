@@ -143,6 +143,24 @@ void gateway_observer::post_pair(std::function<void()> first, std::function<void
   });
 }
 
+void gateway_observer::post_decision(const admission_facts& facts, HANDLE pipe, gateway_event connected) {
+  // Built before anything is posted; the admission observers hear of the
+  // decision before the connection's own tasks.
+  std::function<void()> told = make_admission_notification(context_->observers, facts);
+  if (!facts.allowed) {
+    context_->pool.post(std::move(told));
+    return;
+  }
+  // The name was read while deciding: the handle is the library's, closed
+  // soon after the disconnect.
+  post_pair(
+      [told = std::move(told), insert = make_connection_insert(&context_->connections, pipe, facts.pipe, facts.pid)] {
+        told();
+        insert();
+      },
+      event_task(connected, pipe, facts.pid));
+}
+
 void gateway_observer::on_listen(parlo::ipc::pipe_handle pipe, const char* name) try {
   logging::trace_scope trace(L"gateway_observer::on_listen");
   logger_stream(level_info, L"gateway_observer::on_listen")
@@ -160,23 +178,9 @@ bool gateway_observer::on_local_connect(parlo::ipc::pipe_handle pipe, std::uint3
   admission_facts facts;
   facts.side = gateway_admission_side::local;
   const bool allowed = is_allowed(pipe, pid, facts);
-  // The admission observers hear of the decision before the connection's
-  // own notifications; built before anything is posted.
-  std::function<void()> told = make_admission_notification(context_->observers, facts);
-  if (!allowed) {
-    context_->pool.post(std::move(told));
-    return false;
-  }
-  apply_security(pipe);
-  // The name was read while deciding: the handle is the library's, closed
-  // soon after the disconnect.
-  post_pair(
-      [told = std::move(told), insert = make_connection_insert(&context_->connections, pipe, facts.pipe, pid)] {
-        told();
-        insert();
-      },
-      event_task(gateway_event::local_connect, pipe, pid));
-  return true;
+  if (allowed) apply_security(pipe);
+  post_decision(facts, pipe, gateway_event::local_connect);
+  return allowed;
 } catch (...) {
   logging::log_current_exception(L"gateway_observer::on_local_connect");
   return false;
@@ -221,18 +225,8 @@ bool gateway_observer::on_remote_connect(parlo::ipc::pipe_handle pipe, std::uint
   admission_facts facts;
   facts.side = gateway_admission_side::remote;
   const bool allowed = is_allowed(pipe, pid, facts);
-  std::function<void()> told = make_admission_notification(context_->observers, facts);
-  if (!allowed) {
-    context_->pool.post(std::move(told));
-    return false;
-  }
-  post_pair(
-      [told = std::move(told), insert = make_connection_insert(&context_->connections, pipe, facts.pipe, pid)] {
-        told();
-        insert();
-      },
-      event_task(gateway_event::remote_connect, pipe, pid));
-  return true;
+  post_decision(facts, pipe, gateway_event::remote_connect);
+  return allowed;
 } catch (...) {
   logging::log_current_exception(L"gateway_observer::on_remote_connect");
   return false;

@@ -146,6 +146,10 @@ class gateway_observer final : public parlo::ipc::gateway::events {
   std::function<void()> event_task(gateway_event event, HANDLE pipe, std::uint32_t pid = 0,
                                    std::uint32_t err = 0);
   void post_event(gateway_event event, HANDLE pipe, std::uint32_t pid = 0, std::uint32_t err = 0);
+  // The decision's admission notification, and for an admitted connection
+  // its insert and its `connected` notification, in that order. Throws
+  // (memory) before posting anything.
+  void post_decision(const admission_facts& facts, HANDLE pipe, gateway_event connected);
   // Posts both as one task, or neither when memory runs out: a connection's
   // insert without its notification, or its notification without its
   // removal, would leave the cache out of step with the library, and a later
