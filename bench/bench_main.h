@@ -14,6 +14,8 @@ int run_propagation();
 int run_convergence(const std::vector<std::size_t>& sizes);
 int run_codec();
 int run_admission();
+// Gateway notifications with admission observers (admission_events.cpp).
+int run_admission_events();
 int run_local();
 // The peer role (peer.cpp).
 int run_peer();
