@@ -16,6 +16,8 @@ int run_convergence(const std::vector<std::size_t>& sizes, const std::string& la
 int run_flood();
 int run_codec();
 int run_admission();
+// Gateway notifications with admission observers (admission_events.cpp).
+int run_admission_events();
 int run_local();
 // The peer role (peer.cpp).
 int run_peer();

@@ -2,6 +2,7 @@
 //
 //   vorbel_bench transport | propagation | convergence [--label TEXT] [N...] |
 //                flood | codec | admission | local
+//   vorbel_bench admission-events
 //
 // Each subcommand prints a markdown section; cross-process ones start this
 // program again as their peer (`vorbel_bench peer`). Data for the plots go
@@ -35,6 +36,7 @@ int usage() {
   std::fputs("usage: vorbel_bench transport | propagation | convergence [--label TEXT] [N...] | flood | codec | "
              "admission | local\n",
              stderr);
+  std::fputs("       vorbel_bench admission-events\n", stderr);
   return 2;
 }
 
@@ -47,6 +49,7 @@ int dispatch(int argc, char** argv) {
   if (command == "flood") return bench::run_flood();
   if (command == "codec") return bench::run_codec();
   if (command == "admission") return bench::run_admission();
+  if (command == "admission-events") return bench::run_admission_events();
   if (command == "local") return bench::run_local();
   if (command == "convergence") {
     std::vector<std::size_t> sizes;

@@ -4,6 +4,8 @@
 # curves).
 #
 #   scripts/bench.sh            # every benchmark
+#   scripts/bench.sh admission-events   # only section 7, written into its
+#                                       # own section of docs/benchmarks.md
 #   BUILD_DIR=build-x scripts/bench.sh
 #
 # Installs what is missing (the build's packages, g++ and gnuplot), builds
@@ -59,6 +61,44 @@ run() {
   echo "   $((SECONDS - started)) s"
 }
 
+# splice_section HEADING NEW DOC: the section of DOC that starts with the
+# line HEADING (up to the next "## " heading) becomes the text of file NEW;
+# without such a section NEW goes before the hand-written notes.
+splice_section() {
+  awk -v heading="$1" -v new="$2" '
+    function emit(  line) { while ((getline line < new) > 0) print line; close(new); done = 1 }
+    index($0, heading) == 1 { emit(); skipping = 1; next }
+    skipping && /^## / { skipping = 0 }
+    !done && !skipping && /^## What limits the missed goals/ { emit() }
+    !skipping { print }
+  ' "$3" >"$3.new" && mv "$3.new" "$3"
+}
+
+# One benchmark on its own: gateway notifications with admission observers.
+if [ "${1:-}" = "admission-events" ]; then
+  echo "== configure and build vorbel_bench in $BUILD_DIR"
+  cmake -S "$ROOT" -B "$BUILD_DIR" -G Ninja -DCMAKE_TOOLCHAIN_FILE="$ROOT/cmake/mingw-w64.cmake" >/dev/null
+  cmake --build "$BUILD_DIR" --target vorbel_bench
+  start_wine
+  RUN_DIR="$BUILD_DIR/bench-run-admission-events"  # the full run's outputs stay
+  rm -rf "$RUN_DIR"
+  mkdir -p "$RUN_DIR"
+  export SCRIBO_LOG_FILE
+  SCRIBO_LOG_FILE=$(win_path "$RUN_DIR/component.log")
+  export SCRIBO_LOG_LEVEL=off
+  load_before=$(cut -d' ' -f1-3 /proc/loadavg)
+  run admission-events 300 admission-events
+  load_after=$(cut -d' ' -f1-3 /proc/loadavg)
+  # The date and load of this run under the section's heading.
+  sed -i "1a\\
+\\
+Run on its own on $(date -u '+%Y-%m-%d %H:%M UTC'): $(nproc) cores, load average $load_before before and $load_after after it, $("$WINE" --version 2>/dev/null || echo Wine); the other sections are from the run at the top." \
+    "$RUN_DIR/admission-events.md"
+  splice_section "## 7. Gateway notifications with an admission observer" "$RUN_DIR/admission-events.md" "$DOC"
+  echo "== wrote section 7 of $DOC"
+  exit 0
+fi
+
 install_missing g++ gnuplot-nox
 build
 start_wine
@@ -90,6 +130,7 @@ load_after_burst=$(cut -d' ' -f1-3 /proc/loadavg)
 run codec 180 codec
 run admission 180 admission
 run local 180 local
+run admission-events 300 admission-events
 SCRIBO_LOG_FILE=$(win_path "$RUN_DIR/propagation-logging.log")
 unset SCRIBO_LOG_LEVEL
 run propagation-logging 300 propagation
@@ -107,7 +148,8 @@ gnuplot -e "dir='$RUN_DIR'; out='$PLOT'" "$ROOT/bench/plot.gp"
 # The goal lines of every section, for the summary at the top.
 goals() {
   local f
-  for f in transport propagation convergence convergence-load flood codec codec-native admission local; do
+  for f in transport propagation convergence convergence-load flood codec codec-native admission \
+    admission-events local; do
     grep -h '^- .*\(met\|missed\)' "$RUN_DIR/$f.md" 2>/dev/null | sed "s/^- /- $f: /" || true
   done
 }
@@ -159,6 +201,7 @@ goals() {
   cat "$RUN_DIR/codec-native.md"
   echo
   cat "$RUN_DIR/admission.md" "$RUN_DIR/local.md"
+  cat "$RUN_DIR/admission-events.md"
   if [ -f "$ROOT/bench/analysis.md" ]; then
     echo
     cat "$ROOT/bench/analysis.md"

@@ -5,6 +5,7 @@
 #include <vorbel/ibus.h>
 #include <vorbel/ibus_configuration.h>
 #include <vorbel/igateway.h>
+#include <vorbel/igateway_admission.h>
 #include <vorbel/iobservable.h>
 #include <vorbel/ivorbel.h>
 #include <vorbel/qm_base.h>

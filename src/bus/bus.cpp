@@ -1,5 +1,6 @@
 #include "bus/bus.h"
 
+#include <vorbel/igateway_admission.h>
 #include <windows.h>
 
 #include <algorithm>
@@ -89,6 +90,9 @@ void* bus::GetInterface(GUID iid) {
   if (qm::same_iid(iid, IID_igateway_observer_base) || qm::same_iid(iid, IID_igateway_observer)) {
     return static_cast<igateway_observer*>(this);
   }
+  // The gateway asks each of its observers, the bus among them, at every
+  // admission decision: no face, and nothing to warn about.
+  if (qm::same_iid(iid, IID_igateway_admission_observer)) return nullptr;
   const qm::iid_halves h = qm::split_iid(iid);
   logger_stream(level_warning, L"bus::GetInterface")
       << L"unknown interface " << static_cast<unsigned long long>(h.first + h.last);

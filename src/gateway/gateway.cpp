@@ -62,10 +62,46 @@ void* gateway::GetInterface(GUID iid) {
       qm::same_iid(iid, IID_igateway)) {
     return static_cast<igateway*>(this);
   }
+  if (qm::same_iid(iid, IID_igateway_trust_explainer)) return static_cast<igateway_trust_explainer*>(this);
   const qm::iid_halves h = qm::split_iid(iid);
   logger_stream(level_warning, L"gateway::GetInterface")
       << L"unknown interface " << static_cast<unsigned long long>(h.first + h.last);
   return nullptr;
+}
+
+std::uint32_t gateway::explain_process(std::uint32_t pid, std::uint32_t level,
+                                       igateway_admission_observer* receiver) try {
+  if (receiver == nullptr || level > max_pipe_security_level) {
+    logger_stream(level_error, L"gateway::explain_process")
+        << L"refused: receiver=" << static_cast<void*>(receiver) << L" level=" << level
+        << L" (a receiver and a pipe security level, 0 or 1, are needed)";
+    return ERROR_INVALID_PARAMETER;
+  }
+  const admission_record record(observer_->explain_process(pid, level));
+  receiver->on_admission(&record.view());
+  return 0;
+} catch (...) {
+  logging::log_current_exception(L"gateway::explain_process");
+  return ERROR_OUTOFMEMORY;
+}
+
+std::uint32_t gateway::explain_image(const char* path, std::uint32_t level,
+                                     igateway_admission_observer* receiver) try {
+  std::error_code code;
+  const std::wstring wide = path != nullptr ? winapi::utf8_to_utf16(path, code) : std::wstring();
+  if (receiver == nullptr || level > max_pipe_security_level || wide.empty()) {
+    logger_stream(level_error, L"gateway::explain_image")
+        << L"refused: receiver=" << static_cast<void*>(receiver) << L" level=" << level
+        << L" path=" << (path == nullptr ? L"nullptr" : (wide.empty() ? L"empty or not UTF-8" : L"given"))
+        << L" (a receiver, a path and a pipe security level, 0 or 1, are needed)";
+    return ERROR_INVALID_PARAMETER;
+  }
+  const admission_record record(observer_->explain_image(wide, level));
+  receiver->on_admission(&record.view());
+  return 0;
+} catch (...) {
+  logging::log_current_exception(L"gateway::explain_image");
+  return ERROR_OUTOFMEMORY;
 }
 
 std::uint32_t gateway::export_channel(const char* channel_name, const char* pipe_name,

@@ -5,10 +5,13 @@
 // IPC library's threads never touch it: they call the gateway observer,
 // which reaches this object's observer list only from its own task pool.
 // The observer list is the one piece of state shared between threads; it
-// has its own reader/writer lock.
+// has its own reader/writer lock. The trust explainer face may be called from
+// any host thread while the gateway exists; it reads only what is fixed
+// before the IPC library starts.
 #pragma once
 
 #include <vorbel/igateway.h>
+#include <vorbel/igateway_admission.h>
 
 #include <cstdint>
 #include <map>
@@ -22,7 +25,9 @@
 
 class bus;
 
-class gateway final : public qm::observable<igateway_observer_base*, igateway> {
+// Its primary face is igateway; igateway_trust_explainer is a second face,
+// reached through GetInterface.
+class gateway final : public qm::observable<igateway_observer_base*, igateway>, public igateway_trust_explainer {
  public:
   // Loads parlo_ipc.dll from this component's folder and creates the
   // library's gateway over `owner`'s messaging bus. Throws std::system_error
@@ -33,6 +38,10 @@ class gateway final : public qm::observable<igateway_observer_base*, igateway> {
   ~gateway();
 
   void* GetInterface(GUID iid) override;
+
+  std::uint32_t explain_process(std::uint32_t pid, std::uint32_t level,
+                                igateway_admission_observer* receiver) override;
+  std::uint32_t explain_image(const char* path, std::uint32_t level, igateway_admission_observer* receiver) override;
 
   // Each also carries the bus's service channel over the same pipe. `security`
   // is the pipe's admission level (0: same signer only, 1: any valid signer),

@@ -1,6 +1,7 @@
 #include "gateway/notify_tasks.h"
 
 #include <exception>
+#include <memory>
 
 #include "logging/logger.h"
 
@@ -33,14 +34,16 @@ const event_traits& traits_of(gateway_event event) {
   return table[static_cast<int>(event)];
 }
 
-// Calls `call` with each active observer that gives igateway_observer. An
-// observer's exception is logged and ends this walk only: it must not end
-// the worker thread, and with it the host process.
-template <typename Call>
-void notify_observers(const wchar_t* function, gateway_observer_list* observers, Call&& call) {
+// Calls `call` with each active observer that gives the face `Face` for
+// `iid` (igateway_observer unless said otherwise). An observer's exception
+// is logged and ends this walk only: it must not end the worker thread, and
+// with it the host process.
+template <typename Face = igateway_observer, typename Call>
+void notify_observers(const wchar_t* function, gateway_observer_list* observers, Call&& call,
+                      const GUID& iid = IID_igateway_observer) {
   try {
     observers->walk([&](igateway_observer_base* entry) {
-      auto* observer = static_cast<igateway_observer*>(entry->GetInterface(IID_igateway_observer));
+      auto* observer = static_cast<Face*>(entry->GetInterface(iid));
       if (observer != nullptr) call(observer);
     });
   } catch (const std::exception& e) {
@@ -114,4 +117,14 @@ std::function<void()> make_event_notification(gateway_event event,
                                               connections_cache* cache, HANDLE pipe,
                                               std::uint32_t pid, std::uint32_t err) {
   return task{event, observers, cache, pipe, pid, err};
+}
+
+std::function<void()> make_admission_notification(gateway_observer_list* observers, const admission_facts& facts) {
+  // Shared, not copied: the record's view points into its own strings.
+  std::shared_ptr<const admission_record> record = std::make_shared<const admission_record>(facts);
+  return [observers, record = std::move(record)] {
+    notify_observers<igateway_admission_observer>(
+        L"notify_on_admission_handler::task::operator ()", observers,
+        [&](igateway_admission_observer* o) { o->on_admission(&record->view()); }, IID_igateway_admission_observer);
+  };
 }

@@ -14,6 +14,7 @@
 #include <functional>
 #include <string>
 
+#include "gateway/admission.h"
 #include "gateway/connections_cache.h"
 #include "platform/callback_list.h"
 
@@ -48,3 +49,7 @@ std::function<void()> make_event_notification(gateway_event event,
                                               gateway_observer_list* observers,
                                               connections_cache* cache, HANDLE pipe,
                                               std::uint32_t pid = 0, std::uint32_t err = 0);
+
+// Calls on_admission with a copy of `facts` on every observer that offers
+// igateway_admission_observer; the others are passed over.
+std::function<void()> make_admission_notification(gateway_observer_list* observers, const admission_facts& facts);

@@ -115,6 +115,24 @@ std::string utf16_to_utf8(const wchar_t* text, std::error_code& code) {
   return result;
 }
 
+std::wstring utf8_to_utf16(const char* text, std::error_code& code) {
+  code = std::error_code();
+  if (text == nullptr || *text == '\0') return std::wstring();
+  const int n = ::MultiByteToWideChar(CP_UTF8, MB_ERR_INVALID_CHARS, text, -1, nullptr, 0);
+  if (n == 0) {
+    code = last_error_code();
+    return std::wstring();
+  }
+  std::wstring result(static_cast<std::size_t>(n), L'\0');
+  const int r = ::MultiByteToWideChar(CP_UTF8, MB_ERR_INVALID_CHARS, text, -1, result.data(), n);
+  if (r == 0) {
+    code = last_error_code();
+    return std::wstring();
+  }
+  result.resize(static_cast<std::size_t>(r - 1));
+  return result;
+}
+
 std::wstring query_file_name(HANDLE handle, std::error_code& code) {
   // The buffer holds a FILE_NAME_INFO: a 32-bit byte length, then the name.
   std::wstring buffer(path_capacity, L'\0');

@@ -54,6 +54,10 @@ inline std::string utf16_to_utf8(const std::wstring& text, std::error_code& code
   return utf16_to_utf8(text.c_str(), code);
 }
 
+// The wide form of a zero-terminated UTF-8 text; empty and the code on
+// failure, invalid UTF-8 included.
+std::wstring utf8_to_utf16(const char* text, std::error_code& code);
+
 // The name of the file behind a kernel handle; for a named pipe a backslash
 // and the pipe's own name. Empty and the code on failure.
 std::wstring query_file_name(HANDLE handle, std::error_code& code);

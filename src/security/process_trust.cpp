@@ -97,8 +97,13 @@ trust_level signature_checker::get_process_trust(const std::wstring& path) {
   return get_image_trust(file.get(), path);
 }
 
-trust_level signature_checker::get_image_trust(HANDLE file, const std::wstring& path) {
+trust_level signature_checker::get_image_trust(HANDLE file, const std::wstring& path, trust_evidence* evidence) {
   const image_verdict verdict = verify_image(file, path);
+  if (evidence != nullptr) {
+    *evidence = trust_evidence{};
+    evidence->verification = verdict.result;
+    if (verdict.signer) evidence->signer = verdict.signer->subject;
+  }
   // The lines of check_low_security, as for a verification by path.
   if (!verdict.trusted) {
     if (!verdict.code) {
@@ -149,10 +154,12 @@ processes_trust_cache::~processes_trust_cache() {
   // low and high maps.
 }
 
-trust_level processes_trust_cache::find_image(const image_identity& image) {
+trust_level processes_trust_cache::find_image(const image_identity& image, trust_evidence* evidence) {
   std::lock_guard<srw_mutex> lock(mutex_);
   const auto found = images_.find(image);
-  return found != images_.end() ? found->second.trust : trust_level::unknown;
+  if (found == images_.end()) return trust_level::unknown;
+  if (evidence != nullptr) *evidence = found->second.evidence;
+  return found->second.trust;
 }
 
 void processes_trust_cache::release_image_locked(const entry& leaving) {
@@ -161,11 +168,15 @@ void processes_trust_cache::release_image_locked(const entry& leaving) {
   if (found != images_.end() && --found->second.processes == 0) images_.erase(found);
 }
 
-trust_level processes_trust_cache::find(const process_info& info) {
+trust_level processes_trust_cache::find(const process_info& info, trust_evidence* evidence) {
   std::lock_guard<srw_mutex> lock(mutex_);
-  if (high_.count(info) != 0) return trust_level::high_trust;
-  if (low_.count(info) != 0) return trust_level::low_trust;
-  if (untrusted_.count(info) != 0) return trust_level::untrusted;
+  for (const trust_level trust : {trust_level::high_trust, trust_level::low_trust, trust_level::untrusted}) {
+    const map_type& map = *map_for_locked(trust);
+    const auto found = map.find(info);
+    if (found == map.end()) continue;
+    if (evidence != nullptr) *evidence = found->second.evidence;
+    return trust;
+  }
   return trust_level::unknown;
 }
 
@@ -183,7 +194,7 @@ processes_trust_cache::map_type* processes_trust_cache::map_for_locked(trust_lev
 }
 
 void processes_trust_cache::add(const process_info& info, winapi::unique_handle process, trust_level trust,
-                                const std::optional<image_identity>& image) {
+                                const std::optional<image_identity>& image, const trust_evidence& evidence) {
   if (!process) {
     // A null handle in the wait list would make every wait fail and end
     // exit monitoring for all cached processes.
@@ -196,11 +207,11 @@ void processes_trust_cache::add(const process_info& info, winapi::unique_handle 
   if (map == nullptr) return;  // `process` closes as it leaves
   trim_locked();
   // An equal key keeps its entry; ours closes.
-  const bool inserted = map->emplace(info, entry{std::move(process), image}).second;
+  const bool inserted = map->emplace(info, entry{std::move(process), image, evidence}).second;
   if (inserted && image) {
     // A later verdict about the file (it was verified again meanwhile) is
     // the same as the earlier: the file cannot change while they run.
-    auto& verdict = images_.emplace(*image, image_entry{trust, 0}).first->second;
+    auto& verdict = images_.emplace(*image, image_entry{trust, 0, evidence}).first->second;
     ++verdict.processes;
   }
   ::SetEvent(wake_event_.get());

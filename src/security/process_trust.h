@@ -42,6 +42,23 @@ bool operator<(const process_info& left, const process_info& right);
 // "QueryFullProcessImageName failed") with the Win32 code.
 process_info get_process_info(std::uint32_t pid, HANDLE process);
 
+// What a classification rests on, kept beside its verdict so that a
+// decision answered from the cache can still say why.
+struct trust_evidence {
+  static constexpr std::uint32_t not_verified = 0xFFFFFFFF;
+  // What the image's verification returned (0: it verifies), or
+  // not_verified when the verdict came before any verification.
+  std::uint32_t verification = not_verified;
+  // The signer name that verification found; empty when none.
+  std::wstring signer;
+  // Why an untrusted verdict is untrusted.
+  enum class finding : std::uint32_t {
+    signature,           // the signature (verification says how)
+    other_file,          // the process does not run the file at its image's path
+    unprotected_path,    // the process's user may change its image's path
+  } untrusted_by = finding::signature;
+};
+
 // Classifies image files against the current process's own signer.
 // Immutable after construction; any thread may call it at once.
 class signature_checker {
@@ -52,6 +69,8 @@ class signature_checker {
   explicit signature_checker(std::optional<signature> current);
 
   bool has_signature() const { return current_.has_value(); }
+  // The current process's signer name; empty without a signature.
+  std::wstring signer_name() const { return current_ ? current_->subject : std::wstring(); }
   // True when the file's signature verifies.
   bool check_low_security(const std::wstring& path);
   // untrusted, low_trust or high_trust (same signer name, ASCII case
@@ -59,8 +78,9 @@ class signature_checker {
   // it through that handle; a file that cannot be opened is untrusted.
   trust_level get_process_trust(const std::wstring& path);
   // The same for a file already open as `file` (`path` names it in lines):
-  // one verification, whose own signer is compared.
-  trust_level get_image_trust(HANDLE file, const std::wstring& path);
+  // one verification, whose own signer is compared. With `evidence`, what
+  // the verification returned and the signer it found.
+  trust_level get_image_trust(HANDLE file, const std::wstring& path, trust_evidence* evidence = nullptr);
 
  private:
   std::optional<signature> current_;
@@ -97,18 +117,19 @@ class processes_trust_cache {
   processes_trust_cache& operator=(const processes_trust_cache&) = delete;
   ~processes_trust_cache();
 
-  // high_trust, low_trust or untrusted when cached; unknown otherwise.
-  trust_level find(const process_info& info);
+  // high_trust, low_trust or untrusted when cached; unknown otherwise. With
+  // `evidence`, what the verdict rests on, when cached.
+  trust_level find(const process_info& info, trust_evidence* evidence = nullptr);
   // Stores `process` (SYNCHRONIZE access; the cache takes it) under `info`
-  // in the map of `trust`. An equal key already cached keeps its entry and
-  // the new handle is closed; unknown or other values store nothing. With
-  // `image`, `trust` is also the verdict about that file while the process
-  // is cached.
+  // in the map of `trust`, with the `evidence` for it. An equal key already
+  // cached keeps its entry and the new handle is closed; unknown or other
+  // values store nothing. With `image`, `trust` is also the verdict about
+  // that file while the process is cached.
   void add(const process_info& info, winapi::unique_handle process, trust_level trust,
-           const std::optional<image_identity>& image = std::nullopt);
+           const std::optional<image_identity>& image = std::nullopt, const trust_evidence& evidence = {});
   // The verdict about an image file that a cached process runs; unknown
-  // when none does.
-  trust_level find_image(const image_identity& image);
+  // when none does. With `evidence`, as for find.
+  trust_level find_image(const image_identity& image, trust_evidence* evidence = nullptr);
 
   // Read-only views, for diagnostics and tests.
   std::size_t size() const;
@@ -125,11 +146,13 @@ class processes_trust_cache {
   struct entry {
     winapi::unique_handle process;
     std::optional<image_identity> image;
+    trust_evidence evidence;
   };
   using map_type = std::map<process_info, entry>;
   struct image_entry {
     trust_level trust;
     std::size_t processes;  // cached processes that run the file
+    trust_evidence evidence;
   };
 
   void monitor();

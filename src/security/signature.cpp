@@ -247,6 +247,7 @@ image_verdict verify_image(HANDLE file, const std::wstring& path) {
     }
   } closer{data, action};
   const LONG result = ::WinVerifyTrust(/* window */ nullptr, &action, &data);
+  verdict.result = static_cast<std::uint32_t>(result);
   switch (static_cast<DWORD>(result)) {
     case 0:
       verdict.trusted = true;

@@ -8,6 +8,7 @@
 
 #include <windows.h>
 
+#include <cstdint>
 #include <optional>
 #include <string>
 #include <system_error>
@@ -48,6 +49,9 @@ std::optional<signature> get_current_signature();
 struct image_verdict {
   // The embedded signature verifies (the same settings as is_trusted).
   bool trusted = false;
+  // What the verification returned: 0, or an HRESULT such as 0x800B0100 (no
+  // signature) or 0x80096010 (the digest does not match).
+  std::uint32_t result = 0;
   // A failure of verification other than "unsigned" or "not trusted".
   std::error_code code;
   // When trusted: the signer, or absent with `signer_code` when it cannot be

@@ -327,6 +327,8 @@ class this_process {
   bool up() { return registered_ && registry_.get_gateway("main") != nullptr; }
   ibus& bus() { return *bus_; }
   gateway_observer& events() { return static_cast<gateway*>(registry_.get_gateway("main"))->events(); }
+  // The gateway's public face, as a host reaches it.
+  igateway& gateway_face() { return *registry_.get_gateway("main"); }
   std::size_t connection_count() {
     std::size_t count = 0;
     events().run_on_worker([&](connections_cache& cache) { count = cache.size(); });

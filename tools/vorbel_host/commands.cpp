@@ -41,6 +41,7 @@ const verb_info verbs[] = {
     {"wait-for", command::verb::wait_for, 2, 4, "wait-for CH ID [PID] [TIMEOUT_MS]"},
     {"wait-for-absent", command::verb::wait_for_absent, 2, 4,
      "wait-for-absent CH ID [PID] [TIMEOUT_MS]"},
+    {"trust", command::verb::trust, 1, SIZE_MAX, "trust PID|PATH [LEVEL]"},
     {"echo", command::verb::echo, 0, SIZE_MAX, "echo [TEXT]"},
     {"help", command::verb::help, 0, 0, "help"},
     {"quit", command::verb::quit, 0, 0, "quit"},
@@ -78,6 +79,13 @@ const char* commands_help() {
          "                        table; fails after TIMEOUT_MS (default 10000)\n"
          "  wait-for-absent CH ID [PID] [TIMEOUT_MS]\n"
          "                        the same, until no such listener is left\n"
+         "  trust PID|PATH [LEVEL]\n"
+         "                        how the gateway judges process PID (\"self\": this\n"
+         "                        process) or the image file PATH against a pipe of\n"
+         "                        LEVEL (0 or 1, default 0): ALLOW or DENY, its trust,\n"
+         "                        the verification's result, both signers and the reason;\n"
+         "                        the image is verified afresh (the trust cache is not\n"
+         "                        used). PATH may hold blanks\n"
          "  echo [TEXT]           print TEXT (a marker for scripts and demos)\n"
          "  help                  this list\n"
          "  quit                  tear down and exit\n"
@@ -160,10 +168,56 @@ parsed_line parse_command(const std::string& raw, std::uint32_t self_pid) {
       c.text = after == std::string::npos ? std::string() : trim(line.substr(after));
       break;
     }
+    case command::verb::trust: {
+      // The target is everything after the verb, but for a last word 0 or 1
+      // after it: a path may hold blanks.
+      std::string target = trim(line.substr(line.find_first_of(" \t")));
+      if (args >= 2 && (words.back() == "0" || words.back() == "1")) {
+        c.level = words.back() == "1" ? 1 : 0;
+        target = trim(target.substr(0, target.size() - 1));
+      } else if (args == 2 && parse_u32(words[1])) {
+        return bad_command{"trust: LEVEL must be 0 or 1, not \"" + printable(words.back()) + "\""};
+      }
+      if (target == "self") {
+        c.pid = self_pid;
+      } else if (target.find_first_not_of("0123456789") == std::string::npos) {
+        c.pid = parse_u32(target);
+        if (!c.pid) return bad_command{"trust: PID must be a process id, not \"" + printable(target) + "\""};
+      } else {
+        c.text = target;
+      }
+      break;
+    }
     default:
       break;
   }
   return c;
+}
+
+command_runner::outcome command_runner::explain(const command& c) {
+  if (explainer_ == nullptr) {
+    out_.error(c.line + (has_gateway_ ? ": the gateway explains nothing (an older vorbel.dll?)"
+                                      : ": the bus has no gateway to explain its admission"));
+    return outcome::failed;
+  }
+  // The explainer calls back once, on this thread, before it returns.
+  struct receiver final : igateway_admission_observer {
+    console& out;
+    explicit receiver(console& to) : out(to) {}
+    void* GetInterface(GUID iid) override {
+      return qm::same_iid(iid, IID_igateway_admission_observer) ? this : nullptr;
+    }
+    void on_admission(const gateway_admission* a) override {
+      if (a != nullptr) out.emit(admission_text("trust", *a), admission_object("trust", *a));
+    }
+  } printer(out_);
+  const std::uint32_t err = c.pid ? explainer_->explain_process(*c.pid, c.level, &printer)
+                                  : explainer_->explain_image(c.text.c_str(), c.level, &printer);
+  if (err != 0) {
+    out_.error(c.line + ": " + describe_error(err));
+    return outcome::failed;
+  }
+  return outcome::ok;
 }
 
 command_runner::outcome command_runner::run(const command& c) {
@@ -222,6 +276,8 @@ command_runner::outcome command_runner::run(const command& c) {
       out_.emit(text, object);
       return outcome::ok;
     }
+    case command::verb::trust:
+      return explain(c);
     case command::verb::echo:
       out_.emit(c.text, ordered_json{{"event", "echo"}, {"text", c.text}});
       return outcome::ok;

@@ -9,6 +9,7 @@
 #include "observed.h"
 
 #include <vorbel/ibus.h>
+#include <vorbel/igateway_admission.h>
 
 #include <cstdint>
 #include <optional>
@@ -32,6 +33,7 @@ struct command {
     sleep,
     wait_for,
     wait_for_absent,
+    trust,
     echo,
     help,
     quit,
@@ -39,9 +41,10 @@ struct command {
   verb what = verb::help;
   std::string channel;
   std::string id;
-  std::optional<std::uint32_t> pid;  // wait-for: empty means any process
+  std::optional<std::uint32_t> pid;  // wait-for: empty means any process; trust: the process
   std::uint32_t ms = 0;              // sleep, or the wait's timeout
-  std::string text;                  // echo
+  std::uint32_t level = 0;           // trust: the pipe security level
+  std::string text;                  // echo; trust: the image path when no pid
   std::string line;                  // as written, for messages
 };
 
@@ -64,14 +67,19 @@ class command_runner {
  public:
   enum class outcome { ok, failed, quit };
 
-  command_runner(ibus* bus, bool has_gateway, observed_state& state, console& out)
-      : bus_(bus), has_gateway_(has_gateway), state_(state), out_(out) {}
+  // `explainer` is the gateway's trust explainer, null without a gateway.
+  command_runner(ibus* bus, bool has_gateway, igateway_trust_explainer* explainer, observed_state& state,
+                 console& out)
+      : bus_(bus), explainer_(explainer), has_gateway_(has_gateway), state_(state), out_(out) {}
 
   // Runs one command; a failure has been written to standard error.
   outcome run(const command& c);
 
  private:
+  outcome explain(const command& c);
+
   ibus* const bus_;
+  igateway_trust_explainer* const explainer_;
   const bool has_gateway_;
   observed_state& state_;
   console& out_;

@@ -74,6 +74,12 @@ const char usage_text[] =
     "  error local|remote pipe=NAME pid=PID err=CODE\n"
     "                                     gateway connection events (\"local\": a\n"
     "                                     pipe this process serves)\n"
+    "  admission local|remote ALLOW|DENY pid=PID pipe=NAME level=L trust=T\n"
+    "      verification=NAME(0xCODE) signer=\"S\" own_signer=\"S\" image=\"PATH\"\n"
+    "      source=SRC reason=WORD \"TEXT\"\n"
+    "                                     every admission decision of the gateway,\n"
+    "                                     on one line; `trust` prints the same after\n"
+    "                                     \"trust ALLOW|DENY\"\n"
     "  Blanks and control bytes in names are written as \\xNN. Errors go to\n"
     "  standard error as \"vorbel_host: ...\".\n"
     "\n"
@@ -326,6 +332,12 @@ class bus_session {
     return bus_;
   }
   bool has_gateway() const { return gateway_ != nullptr; }
+  // The gateway's trust explainer face; null without a gateway.
+  igateway_trust_explainer* explainer() const {
+    return gateway_ != nullptr
+               ? static_cast<igateway_trust_explainer*>(gateway_->GetInterface(IID_igateway_trust_explainer))
+               : nullptr;
+  }
 
   bool observe_bus(ibus_observer_base* observer) {
     if (!bus_->add_observer(observer, /* context */ 0)) return false;
@@ -400,7 +412,7 @@ int run(const options& opts, const std::vector<command>& exec_commands, const bu
                                   {"pid", pid},
                                   {"gateway", session.has_gateway()}});
 
-  command_runner runner(bus, session.has_gateway(), state, out);
+  command_runner runner(bus, session.has_gateway(), session.explainer(), state, out);
   bool failed = false;
   // False: stop reading commands.
   auto execute = [&](const command& c) {

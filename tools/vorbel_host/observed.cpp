@@ -2,6 +2,7 @@
 
 #include "text.h"
 
+#include <cstdio>
 #include <cstring>
 #include <tuple>
 
@@ -36,7 +37,120 @@ ordered_json listener_object(const char* event, std::uint32_t pid, const std::st
   return ordered_json{{"event", event}, {"pid", pid}, {"channel", channel}, {"id", id}};
 }
 
+const char* side_word(gateway_admission_side side) {
+  switch (side) {
+    case gateway_admission_side::local:
+      return "local";
+    case gateway_admission_side::remote:
+      return "remote";
+    case gateway_admission_side::explanation:
+      return "explain";
+  }
+  return "";
+}
+
+const char* trust_word(gateway_admission_trust trust) {
+  switch (trust) {
+    case gateway_admission_trust::low_trust:
+      return "low_trust";
+    case gateway_admission_trust::high_trust:
+      return "high_trust";
+    case gateway_admission_trust::untrusted:
+      return "untrusted";
+    case gateway_admission_trust::unknown:
+      return "unknown";
+  }
+  return "";
+}
+
+const char* source_word(gateway_admission_source source) {
+  switch (source) {
+    case gateway_admission_source::none:
+      return "none";
+    case gateway_admission_source::judged:
+      return "judged";
+    case gateway_admission_source::cached_process:
+      return "cached_process";
+    case gateway_admission_source::cached_image:
+      return "cached_image";
+  }
+  return "";
+}
+
+const char* reason_word(gateway_admission_reason reason) {
+  switch (reason) {
+    case gateway_admission_reason::admitted:
+      return "admitted";
+    case gateway_admission_reason::no_own_signer:
+      return "no_own_signer";
+    case gateway_admission_reason::pipe_not_configured:
+      return "pipe_not_configured";
+    case gateway_admission_reason::process_not_inspected:
+      return "process_not_inspected";
+    case gateway_admission_reason::image_not_judged:
+      return "image_not_judged";
+    case gateway_admission_reason::signature_invalid:
+      return "signature_invalid";
+    case gateway_admission_reason::image_replaced:
+      return "image_replaced";
+    case gateway_admission_reason::image_path_unprotected:
+      return "image_path_unprotected";
+    case gateway_admission_reason::other_signer:
+      return "other_signer";
+  }
+  return "";
+}
+
+std::string hex8(std::uint32_t value) {
+  char text[11];
+  std::snprintf(text, sizeof text, "0x%08x", static_cast<unsigned>(value));
+  return text;
+}
+
 }  // namespace
+
+std::string admission_text(const char* word, const gateway_admission& a) {
+  std::string text = word;
+  if (a.side != gateway_admission_side::explanation) text += std::string(" ") + side_word(a.side);
+  text += a.allowed ? " ALLOW" : " DENY";
+  text += " pid=" + std::to_string(a.pid);
+  if (a.side != gateway_admission_side::explanation) text += " pipe=" + printable(str(a.pipe));
+  text += " level=" + (a.level == gateway_admission_no_level ? std::string("none") : std::to_string(a.level));
+  text += std::string(" trust=") + trust_word(a.trust);
+  // TRUST_E_NOSIGNATURE(0x800b0100); a code without a name is its number.
+  const std::string name = str(a.verification_name);
+  text += " verification=" + printable(name);
+  if (a.verification != gateway_admission_not_verified && name.rfind("0x", 0) != 0) {
+    text += "(" + hex8(a.verification) + ")";
+  }
+  text += " signer=" + quoted_word(str(a.signer)) + " own_signer=" + quoted_word(str(a.own_signer));
+  text += " image=" + quoted_word(str(a.image));
+  text += std::string(" source=") + source_word(a.source);
+  text += std::string(" reason=") + reason_word(a.reason) + " " + quoted_word(str(a.reason_text));
+  return text;
+}
+
+ordered_json admission_object(const char* event, const gateway_admission& a) {
+  ordered_json object{{"event", event}};
+  if (a.side != gateway_admission_side::explanation) {
+    object["side"] = side_word(a.side);
+    object["pipe"] = str(a.pipe);
+  }
+  object["verdict"] = a.allowed ? "ALLOW" : "DENY";
+  object["pid"] = a.pid;
+  object["level"] = a.level == gateway_admission_no_level ? ordered_json(nullptr) : ordered_json(a.level);
+  object["trust"] = trust_word(a.trust);
+  object["verification"] =
+      a.verification == gateway_admission_not_verified ? ordered_json(nullptr) : ordered_json(a.verification);
+  object["verification_name"] = str(a.verification_name);
+  object["signer"] = str(a.signer);
+  object["own_signer"] = str(a.own_signer);
+  object["image"] = str(a.image);
+  object["source"] = source_word(a.source);
+  object["reason"] = reason_word(a.reason);
+  object["reason_text"] = str(a.reason_text);
+  return object;
+}
 
 void observed_state::listener_added(std::uint32_t pid, const std::string& channel,
                                     const std::string& id) {
@@ -91,6 +205,11 @@ void observed_state::gateway_event(const char* event, bool local, const std::str
   }
   out_.emit(text, object);
   changed_.notify_all();
+}
+
+void observed_state::admission(const gateway_admission& a) {
+  std::lock_guard<std::mutex> lock(mutex_);
+  out_.emit(admission_text("admission", a), admission_object("admission", a));
 }
 
 std::optional<std::uint32_t> observed_state::find_locked(const listener& wanted,
@@ -173,7 +292,13 @@ void* gateway_watch::GetInterface(GUID iid) {
       qm::same_iid(iid, IID_IQmBaseInterface)) {
     return static_cast<igateway_observer*>(this);
   }
+  if (qm::same_iid(iid, IID_igateway_admission_observer)) return static_cast<igateway_admission_observer*>(this);
   return nullptr;
+}
+
+void gateway_watch::on_admission(const gateway_admission* admission) {
+  if (admission == nullptr) return;
+  guarded([&] { state_.admission(*admission); });
 }
 
 void gateway_watch::on_listen(const char* name) {

@@ -14,6 +14,9 @@
 
 #include <vorbel/ibus.h>
 #include <vorbel/igateway.h>
+#include <vorbel/igateway_admission.h>
+
+#include <nlohmann/json.hpp>
 
 #include <chrono>
 #include <condition_variable>
@@ -38,6 +41,12 @@ struct connection {
   }
 };
 
+// One admission decision, or an explanation, as the host prints it: the
+// text "WORD [SIDE] ALLOW|DENY pid=... reason=..." and the JSON object of
+// `event`. Strings of `a` are read during the call only.
+std::string admission_text(const char* word, const gateway_admission& a);
+nlohmann::ordered_json admission_object(const char* event, const gateway_admission& a);
+
 class observed_state {
  public:
   explicit observed_state(console& out) : out_(out) {}
@@ -50,6 +59,7 @@ class observed_state {
   // `event` is "listen", "connect", "start", "disconnect" or "error".
   void gateway_event(const char* event, bool local, const std::string& pipe, std::uint32_t pid,
                      std::optional<std::uint32_t> err);
+  void admission(const gateway_admission& a);
 
   // Command thread. Waits until some process (`pid`, or any when empty) has
   // the listener (`present`) or none has it (`!present`). Returns the pid
@@ -88,11 +98,13 @@ class bus_watch final : public ibus_observer {
   observed_state& state_;
 };
 
-// Observer of the bus's gateway; called on the gateway's notifier thread.
-class gateway_watch final : public igateway_observer {
+// Observer of the bus's gateway, of its connections and of its admission
+// decisions; called on the gateway's notifier thread.
+class gateway_watch final : public igateway_observer, public igateway_admission_observer {
  public:
   explicit gateway_watch(observed_state& state) : state_(state) {}
   void* GetInterface(GUID iid) override;
+  void on_admission(const gateway_admission* admission) override;
   void on_listen(const char* name) override;
   void on_local_connect(const char* name, std::uint32_t pid) override;
   void on_local_disconnect(const char* name, std::uint32_t pid) override;

@@ -58,6 +58,25 @@ std::string printable(std::string_view name) {
   return out;
 }
 
+std::string quoted_word(std::string_view text) {
+  static const char digits[] = "0123456789abcdef";
+  std::string out = "\"";
+  for (char c : text) {
+    const auto byte = static_cast<unsigned char>(c);
+    if (c == '\\' || c == '"') {
+      out += '\\';
+      out += c;
+    } else if (byte < 0x20 || byte == 0x7F) {
+      out += "\\x";
+      out += digits[byte >> 4];
+      out += digits[byte & 0xF];
+    } else {
+      out += c;
+    }
+  }
+  return out + "\"";
+}
+
 std::string describe_error(std::uint32_t code) {
   std::string out = "err=" + std::to_string(code);
   wchar_t* buffer = nullptr;

@@ -25,6 +25,12 @@ std::optional<std::uint32_t> parse_u32(std::string_view text,
 // Other bytes, UTF-8 included, pass unchanged.
 std::string printable(std::string_view name);
 
+// A text as one quoted word: a double quote, the text with each backslash
+// and double quote preceded by a backslash and bytes below 0x20 and 0x7F
+// written as \xNN, a double quote. For paths and signer names, which hold
+// blanks.
+std::string quoted_word(std::string_view text);
+
 // "err=<code> (<system text>)", or just "err=<code>" when the system has no
 // text for it.
 std::string describe_error(std::uint32_t code);

@@ -14,6 +14,7 @@
 #include <vector>
 
 #include "platform/handles.h"
+#include "security/signature.h"
 
 std::wstring in_dir(const std::wstring& name) {
   std::wstring path(MAX_PATH, L'\0');
@@ -96,7 +97,8 @@ TEST(vorbel_host_test, help_documents_every_option_command_and_exit_code) {
   for (const char* word :
        {"--config", "--bus", "--dll-dir", "--exec", "--stdin", "--json", "--echo", "--keep-going", "--log",
         "register CH ID", "unregister CH ID", "registered CH ID", "list", "connections", "sleep MS",
-        "wait-for CH ID [PID] [TIMEOUT_MS]", "wait-for-absent CH ID", "quit", "exported_channels",
+        "wait-for CH ID [PID] [TIMEOUT_MS]", "wait-for-absent CH ID", "trust PID|PATH [LEVEL]", "admission local|remote",
+        "quit", "exported_channels",
         "imported_channels", "remote_bus", "link_type", "security", "0  every command", "1  a command failed",
         "2  bad usage", "3  vorbel.dll"}) {
     EXPECT_NE(r.text.find(word), std::string::npos) << word;
@@ -128,4 +130,51 @@ TEST(vorbel_host_test, scripted_run_through_commands_and_notifications_with_the_
   const std::string log = read_file(L"text.log");
   EXPECT_NE(log.find("bus name: text_bus"), std::string::npos) << log;
   EXPECT_NE(log.find("notify_new_listener " + by.substr(0, by.size() - 1)), std::string::npos) << log;
+}
+
+// `trust` as an operator types it: a process by pid ("self"), an image by a
+// path with blanks in it, as text and as JSON; refused without a gateway or
+// with a level other than 0 or 1.
+TEST(vorbel_host_test, trust_explains_a_process_or_an_image_and_refuses_what_it_cannot) {
+  write_file(L"serving.json", R"({"local_channels": ["a"], "exported_channels": [)"
+                              R"({"channel": "a", "pipe": "\\\\.\\PIPE\\vorbel_host_test_trust"}]})");
+  write_file(L"alone.json", R"({"local_channels": ["a"]})");
+  ::CreateDirectoryW(in_dir(L"with blank").c_str(), nullptr);
+  ASSERT_TRUE(::CopyFileW(in_dir(L"vorbel_host.exe").c_str(), in_dir(L"with blank\\copy of host.exe").c_str(), FALSE));
+  std::string copy = std::filesystem::path(in_dir(L"with blank\\copy of host.exe")).string();
+  std::string quoted_copy;  // as the line quotes it
+  for (char c : copy) quoted_copy += c == '\\' ? std::string("\\\\") : std::string(1, c);
+  const auto ours = get_current_signature();
+  ASSERT_TRUE(ours.has_value()) << "the test program is signed like vorbel_host";
+  const std::string signers = "signer=\"" + std::string(ours->subject.begin(), ours->subject.end()) + "\" own_signer=\"" +
+                              std::string(ours->subject.begin(), ours->subject.end()) + "\"";
+  // Configuration, command, more arguments, exit code, what the output must hold (%PID%: the host's pid).
+  const std::tuple<const wchar_t*, std::string, std::wstring, DWORD, std::vector<std::string>> cases[] = {
+      {L"serving.json", "trust self 1", L"", 0,
+       {"\ntrust ALLOW pid=%PID% level=1 trust=high_trust verification=ERROR_SUCCESS(0x00000000) " + signers +
+        " image=\"", "vorbel_host.exe\" source=judged reason=admitted \"admitted\"\n"}},
+      {L"serving.json", "trust " + copy + " 0", L"", 0,
+       {"\ntrust ALLOW pid=0 level=0 trust=high_trust verification=ERROR_SUCCESS(0x00000000) " + signers +
+        " image=\"" + quoted_copy + "\" source=judged"}},
+      {L"serving.json", "trust " + copy + "x 1", L"", 0,
+       {"\ntrust DENY pid=0 level=1 trust=unknown verification=not_verified", "reason=image_not_judged"}},
+      {L"serving.json", "trust self", L"--json", 0,
+       {"\n{\"event\":\"trust\",\"verdict\":\"ALLOW\",\"pid\":%PID%,\"level\":0,\"trust\":\"high_trust\","
+        "\"verification\":0,\"verification_name\":\"ERROR_SUCCESS\",\"signer\":\""}},
+      {L"alone.json", "trust self", L"", 1, {"trust self: the bus has no gateway to explain its admission"}},
+      {L"serving.json", "trust 12 7", L"", 2, {"trust: LEVEL must be 0 or 1, not \"7\""}},
+      {L"serving.json", "trust", L"", 2, {"usage: trust PID|PATH [LEVEL]"}},
+      {L"serving.json", "trust 99999999999", L"", 2, {"trust: PID must be a process id"}},
+  };
+  for (const auto& [config, command, extra, code, parts] : cases) {
+    std::vector<std::wstring> arguments = {L"--config", config, L"--exec", std::wstring(command.begin(), command.end())};
+    if (!extra.empty()) arguments.push_back(extra);
+    const run r = run_host(arguments);
+    EXPECT_EQ(code, r.code) << command << "\n" << r.text;
+    for (std::string part : parts) {
+      const std::size_t at = part.find("%PID%");
+      if (at != std::string::npos) part.replace(at, 5, std::to_string(r.pid));
+      EXPECT_NE(std::string::npos, r.text.find(part)) << command << ": " << part << "\n" << r.text;
+    }
+  }
 }
