@@ -11,7 +11,9 @@ namespace bench {
 
 int run_transport();
 int run_propagation();
-int run_convergence(const std::vector<std::size_t>& sizes);
+// `label`, when not empty, names the run in its title ("under load").
+int run_convergence(const std::vector<std::size_t>& sizes, const std::string& label);
+int run_flood();
 int run_codec();
 int run_admission();
 // Gateway notifications with admission observers (admission_events.cpp).

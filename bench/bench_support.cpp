@@ -169,6 +169,19 @@ void peer_process::read_lines() {
   changed_.notify_all();
 }
 
+std::uint64_t table_hash(const listener_list& table) {
+  std::uint64_t hash = 14695981039346656037ull;
+  const auto add = [&](const std::string& text) {
+    for (const char c : text) hash = (hash ^ static_cast<unsigned char>(c)) * 1099511628211ull;
+    hash = (hash ^ 0u) * 1099511628211ull;
+  };
+  for (const listener& item : table) {
+    add(item.channel);
+    add(item.id);
+  }
+  return hash;
+}
+
 bool fixed_configuration::next_local_channel(std::uint64_t* cursor, const char** channel_name) {
   if (*cursor >= local.size()) return false;
   *channel_name = local[(*cursor)++].c_str();

@@ -16,6 +16,7 @@
 #include <thread>
 #include <vector>
 
+#include "bus/listener.h"
 #include "platform/handles.h"
 
 namespace bench {
@@ -108,6 +109,11 @@ class fixed_configuration final : public ibus_configuration {
                              std::uint32_t* link_type, std::uint32_t* security,
                              const char** remote_channel_name, const char** remote_bus_name) override;
 };
+
+// FNV-1a over the listeners of a table in listener order, each as its
+// channel, a zero byte, its id and a zero byte: two processes compare
+// tables with it.
+std::uint64_t table_hash(const listener_list& table);
 
 // Names of the subcommands' own channels and buses.
 constexpr const char* bench_bus = "bench";

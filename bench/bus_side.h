@@ -4,6 +4,7 @@
 #pragma once
 
 #include <vorbel/ibus.h>
+#include <vorbel/igateway.h>
 
 #include <cstdint>
 #include <memory>
@@ -31,6 +32,7 @@ class bus_side {
   bool join(const std::string& pipe);
 
   ibus* bus() const { return bus_; }
+  igateway* gateway() { return registry_.get_gateway(bench_bus); }
   parlo::bus* messaging() const;
   parlo::channel* channel(const char* name) const;
 

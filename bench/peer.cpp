@@ -17,9 +17,15 @@
 // notifications run on the bus's own thread and would otherwise race the
 // command.
 //   service          after the queued deliveries: "service pubs=P bytes=B
-//                    empty=E removed=R": listeners messages of other
+//                    empty=E removed=R drops=D": listeners messages of other
 //                    processes with at least one listener (P, their blob
-//                    bytes B), without listeners (E), and removed listeners
+//                    bytes B), without listeners (E), removed listeners, and
+//                    connections the gateway lost after it had one
+//   table            "table count=C hash=H": the listeners of other
+//                    processes the observer holds, and table_hash of them
+//   ask COUNT MS     post COUNT requests (id 1) on "vorbel_service", one
+//                    every MS milliseconds, as a peer that asks without
+//                    pause                         -> "ok ask ELAPSED_MS"
 //   quit             end
 // Every TICKS is QueryPerformanceCounter's, comparable across processes.
 #include <windows.h>
@@ -66,19 +72,27 @@ class watching_observer final : public ibus_observer {
     std::lock_guard<std::mutex> lock(mutex_);
     return removed_;
   }
+  std::string table_line() {
+    std::lock_guard<std::mutex> lock(mutex_);
+    const listener_list held(table_.begin(), table_.end());
+    return "table count=" + std::to_string(held.size()) + " hash=" + std::to_string(table_hash(held));
+  }
 
-  void on_new_listener(std::uint32_t pid, const char*, const char* id) override {
+  void on_new_listener(std::uint32_t pid, const char* channel, const char* id) override {
     const std::int64_t at = now_ticks();
     if (pid == ::GetCurrentProcessId()) return;
     std::lock_guard<std::mutex> lock(mutex_);
+    table_.insert(listener{channel, id});
     ++held_;
     if (print_) print_line(std::string("+ ") + id + " " + std::to_string(at));
     check_locked(at);
   }
-  void on_listener_removed(std::uint32_t pid, const char*, const char* id) override {
+  void on_listener_removed(std::uint32_t pid, const char* channel, const char* id) override {
     const std::int64_t at = now_ticks();
     if (pid == ::GetCurrentProcessId()) return;
     std::lock_guard<std::mutex> lock(mutex_);
+    const auto found = table_.find(listener{channel, id});
+    if (found != table_.end()) table_.erase(found);
     --held_;
     ++removed_;
     if (print_) print_line(std::string("- ") + id + " " + std::to_string(at));
@@ -97,6 +111,26 @@ class watching_observer final : public ibus_observer {
   long long target_ = -1;
   long long held_ = 0;
   long long removed_ = 0;
+  listener_set table_;
+};
+
+// Counts the connections the gateway lost: every disconnect of a process
+// that had connected. On the gateway's notification thread.
+class connection_counter final : public igateway_observer {
+ public:
+  void* GetInterface(GUID iid) override {
+    return qm::same_iid(iid, IID_igateway_observer) ? static_cast<igateway_observer*>(this) : nullptr;
+  }
+  void on_listen(const char*) override {}
+  void on_local_connect(const char*, std::uint32_t) override {}
+  void on_local_disconnect(const char*, std::uint32_t) override { ++drops; }
+  void on_local_start_communication(const char*, std::uint32_t) override {}
+  void on_local_error(const char*, std::uint32_t, std::uint32_t) override {}
+  void on_remote_connect(const char*, std::uint32_t) override {}
+  void on_remote_disconnect(const char*, std::uint32_t) override { ++drops; }
+  void on_remote_start_communication(const char*, std::uint32_t) override {}
+  void on_remote_error(const char*, std::uint32_t, std::uint32_t) override {}
+  std::atomic<std::uint64_t> drops{0};
 };
 
 // Counts the listeners messages of other processes on "vorbel_service", on
@@ -139,6 +173,7 @@ void echo_message(parlo::message* message, void* context) {
 
 int run_peer() {
   watching_observer observer;
+  connection_counter connections;
   service_counter service;
   std::unique_ptr<bus_side> side;
   winapi::unique_handle raw;  // kept open for the echo thread until exit
@@ -169,6 +204,7 @@ int run_peer() {
       words >> pipe;
       side = std::make_unique<bus_side>();
       const bool built = side->join(pipe) && side->bus()->add_observer(&observer, 0) &&
+                         side->gateway() != nullptr && side->gateway()->add_observer(&connections, 0) &&
                          side->subscribe(bench_channel, &echo_message, side.get()) &&
                          side->subscribe("vorbel_service", &service_counter::on_message, &service);
       print_line(built ? "ok bus" : "error bus");
@@ -188,12 +224,31 @@ int run_peer() {
       print_line("service pubs=" + std::to_string(service.publications.load()) +
                  " bytes=" + std::to_string(service.bytes.load()) +
                  " empty=" + std::to_string(service.empty.load()) +
-                 " removed=" + std::to_string(observer.removed()));
+                 " removed=" + std::to_string(observer.removed()) +
+                 " drops=" + std::to_string(connections.drops.load()));
+    } else if (command == "table") {
+      print_line(observer.table_line());
+    } else if (command == "ask") {
+      int count = 0, period = 1;
+      words >> count >> period;
+      const std::int64_t start = now_ticks();
+      parlo::channel* service_channel = side ? side->channel("vorbel_service") : nullptr;
+      for (int i = 0; i < count && service_channel != nullptr; ++i) {
+        parlo::message* request = side->messaging()->create_message(0);
+        request->set_message_id(1);
+        service_channel->post(request);
+        request->release();
+        ::Sleep(static_cast<DWORD>(period));
+      }
+      print_line("ok ask " + std::to_string(static_cast<long long>(ticks_to_us(now_ticks() - start) / 1000)));
     } else {
       std::fprintf(stderr, "vorbel_bench peer: unknown command \"%s\"\n", line.c_str());
     }
   }
-  if (side) side->bus()->remove_observer(&observer, 0);
+  if (side) {
+    side->bus()->remove_observer(&observer, 0);
+    if (side->gateway() != nullptr) side->gateway()->remove_observer(&connections, 0);
+  }
   side.reset();
   return 0;
 }

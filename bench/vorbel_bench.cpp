@@ -1,7 +1,7 @@
 // vorbel_bench: benchmarks of the component against the raw transport.
 //
-//   vorbel_bench transport | propagation | convergence [N...] | codec |
-//                admission | local
+//   vorbel_bench transport | propagation | convergence [--label TEXT] [N...] |
+//                flood | codec | admission | local
 //   vorbel_bench admission-events
 //
 // Each subcommand prints a markdown section; cross-process ones start this
@@ -33,7 +33,8 @@ int run_codec() {
 namespace {
 
 int usage() {
-  std::fputs("usage: vorbel_bench transport | propagation | convergence [N...] | codec | admission | local\n",
+  std::fputs("usage: vorbel_bench transport | propagation | convergence [--label TEXT] [N...] | flood | codec | "
+             "admission | local\n",
              stderr);
   std::fputs("       vorbel_bench admission-events\n", stderr);
   return 2;
@@ -45,20 +46,26 @@ int dispatch(int argc, char** argv) {
   if (command == "peer") return bench::run_peer();
   if (command == "transport") return bench::run_transport();
   if (command == "propagation") return bench::run_propagation();
+  if (command == "flood") return bench::run_flood();
   if (command == "codec") return bench::run_codec();
   if (command == "admission") return bench::run_admission();
   if (command == "admission-events") return bench::run_admission_events();
   if (command == "local") return bench::run_local();
   if (command == "convergence") {
     std::vector<std::size_t> sizes;
+    std::string label;
     for (int i = 2; i < argc; ++i) {
+      if (std::string(argv[i]) == "--label" && i + 1 < argc) {
+        label = argv[++i];
+        continue;
+      }
       char* end = nullptr;
       const unsigned long long n = std::strtoull(argv[i], &end, 10);
       if (end == argv[i] || *end != '\0' || n == 0 || n > 100000) return usage();
       sizes.push_back(static_cast<std::size_t>(n));
     }
-    if (sizes.empty()) sizes = {10, 100, 1000, 5000};
-    return bench::run_convergence(sizes);
+    if (sizes.empty()) sizes = {1000, 5000, 10000, 20000};
+    return bench::run_convergence(sizes, label);
   }
   return usage();
 }

@@ -111,7 +111,22 @@ export SCRIBO_LOG_LEVEL=off
 load_before=$(cut -d' ' -f1-3 /proc/loadavg)
 run transport 300 transport
 run propagation 300 propagation
-run convergence 420 convergence 10 100 1000 5000
+run convergence 420 convergence 1000 5000 10000 20000
+run flood 300 flood
+# The same bursts with the machine under load: LOAD_PROCESSES busy loops
+# (default 4, twice the cores of the machine these figures come from) share
+# the cores with A and B. Each is stopped by its own pid.
+load_pids=()
+for _ in $(seq "${LOAD_PROCESSES:-4}"); do
+  (while :; do :; done) &
+  load_pids+=($!)
+done
+load_during=$(cut -d' ' -f1-3 /proc/loadavg)
+run convergence-load 600 convergence --label "under load: ${LOAD_PROCESSES:-4} busy loops beside A and B" \
+  1000 5000 10000 20000
+kill "${load_pids[@]}"
+wait "${load_pids[@]}" 2>/dev/null || true
+load_after_burst=$(cut -d' ' -f1-3 /proc/loadavg)
 run codec 180 codec
 run admission 180 admission
 run local 180 local
@@ -125,7 +140,7 @@ echo "== native codec"
 "$NATIVE_DIR/codec_bench_native" "$RUN_DIR/codec_native.dat" >"$RUN_DIR/codec-native.md"
 
 echo "== plot"
-for f in convergence.dat codec_wine.dat codec_native.dat; do
+for f in convergence.dat convergence-load.dat codec_wine.dat codec_native.dat; do
   [ -s "$RUN_DIR/$f" ] || printf '# no data\n1 1 1 1 1\n' >"$RUN_DIR/$f"
 done
 gnuplot -e "dir='$RUN_DIR'; out='$PLOT'" "$ROOT/bench/plot.gp"
@@ -133,7 +148,8 @@ gnuplot -e "dir='$RUN_DIR'; out='$PLOT'" "$ROOT/bench/plot.gp"
 # The goal lines of every section, for the summary at the top.
 goals() {
   local f
-  for f in transport propagation convergence codec codec-native admission admission-events; do
+  for f in transport propagation convergence convergence-load flood codec codec-native admission \
+    admission-events local; do
     grep -h '^- .*\(met\|missed\)' "$RUN_DIR/$f.md" 2>/dev/null | sed "s/^- /- $f: /" || true
   done
 }
@@ -169,6 +185,10 @@ goals() {
   grep -h '^- \|^\*\*' "$RUN_DIR/propagation-logging.md" || true
   echo
   cat "$RUN_DIR/convergence.md"
+  echo "The load average was $load_during when the busy loops had started and $load_after_burst when the run"
+  echo "under load ended."
+  echo
+  cat "$RUN_DIR/convergence-load.md" "$RUN_DIR/flood.md"
   echo "## 4. Codec: the listeners message, per listener"
   echo
   echo "Encode = \`comm::encode_listeners\`, verify = \`comm::verify_listeners\`, decode ="

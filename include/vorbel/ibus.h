@@ -4,6 +4,7 @@
 #include <vorbel/iobservable.h>
 #include <vorbel/qm_base.h>
 
+#include <cstddef>
 #include <cstdint>
 
 // {43B918DC-4CC9-83D6-A040-1D12D54A1A9C}
@@ -34,13 +35,23 @@ struct ibus_observer : ibus_observer_base {
 
 struct ibus_base : IQmBaseInterface {};
 
+// The longest channel name or listener id register_listener takes, in bytes
+// without the terminating zero.
+inline constexpr std::size_t ibus_max_listener_name = 65536;
+
 // A named bus. Obtained from ivorbel::create_bus; valid until the matching
 // destroy_bus. Listener names are narrow, zero-terminated UTF-8.
 struct ibus : ibus_base, qm::iobservable<ibus_observer_base*> {
   // The messaging library's bus object, on which the host does its messaging.
   virtual void* get_messaging_bus() = 0;
-  // 0, 87 for a null argument, or 14 (ERROR_OUTOFMEMORY) when memory ran
-  // out. Registering the same pair twice keeps two entries.
+  // 0; 87 for a null argument, a channel or id longer than
+  // ibus_max_listener_name, or a listener that would make this process's
+  // table too large to publish in one message of the messaging library (about
+  // 16 MiB: the channel and id of each listener plus 32 bytes) or larger than
+  // its peers take from one process (16,384 listeners); or 14
+  // (ERROR_OUTOFMEMORY) when memory ran out. Registering the same pair twice
+  // keeps two entries. Other processes learn of a registration shortly after
+  // it returns (see the architecture notes).
   virtual std::uint32_t register_listener(const char* channel, const char* id) = 0;
   // Removes one entry equal to the pair. 0 (also when none was registered), 87
   // for a null argument, or 14 when memory ran out.

@@ -260,6 +260,12 @@ std::uint32_t bus_impl::post(channel_impl& channel, parlo::message* message) {
     log_line(level_error, function) << "not a live message of this library (released?)";
     return error_invalid_parameter;
   }
+  if (source->incomplete()) {
+    // Delivered, it would reach its receivers without the blob they expect.
+    log_line(level_error, function) << "channel " << channel.name_
+                                    << ": a set_blob on the message was refused; not posted";
+    return error_invalid_data;
+  }
   message_impl* copy = nullptr;
   try {
     copy = message_impl::create(source->content(), /* library_owned */ true);

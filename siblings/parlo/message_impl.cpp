@@ -79,7 +79,9 @@ std::uint32_t message_impl::check_writable(const char* function) const {
 
 message* message_impl::copy() {
   try {
-    return create(content_, /* library_owned */ false);
+    message_impl* copied = create(content_, /* library_owned */ false);
+    copied->incomplete_ = incomplete_;
+    return copied;
   } catch (const std::bad_alloc&) {
     log_line(level_error, "parlo::message::copy") << "out of memory";
     return nullptr;
@@ -123,6 +125,7 @@ std::uint32_t message_impl::remove_blob(const char* name) {
 std::uint32_t message_impl::clear() {
   if (const std::uint32_t refused = check_writable("parlo::message::clear")) return refused;
   content_ = codec::message_content{};
+  incomplete_ = false;
   return success;
 }
 
@@ -164,6 +167,13 @@ const void* message_impl::get_blob(const char* name, std::uint64_t* size) {
 }
 
 std::uint32_t message_impl::set_blob(const char* name, const void* data, std::uint64_t size) {
+  const std::uint32_t result = store_blob(name, data, size);
+  // A sealed message stays as it was sealed: whole.
+  if (result != success && !sealed_) incomplete_ = true;
+  return result;
+}
+
+std::uint32_t message_impl::store_blob(const char* name, const void* data, std::uint64_t size) {
   const char* const function = "parlo::message::set_blob";
   if (name == nullptr || (data == nullptr && size != 0)) {
     log_line(level_error, function) << (name == nullptr ? "name is nullptr" : "data is nullptr");

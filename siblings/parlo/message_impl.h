@@ -31,6 +31,9 @@ class message_impl final : public parlo::message {
 
   const codec::message_content& content() const { return content_; }
   void seal_now() { sealed_ = true; }
+  // A set_blob on it was refused since it was made or cleared: it is not
+  // the message its caller built, and post() refuses it.
+  bool incomplete() const { return incomplete_; }
 
   message* copy() override;
   bool is_sealed() override;
@@ -65,9 +68,13 @@ class message_impl final : public parlo::message {
   // 0, or error_access_denied with a line under `function`.
   std::uint32_t check_writable(const char* function) const;
 
+  // set_blob without the refusal bookkeeping.
+  std::uint32_t store_blob(const char* name, const void* data, std::uint64_t size);
+
   codec::message_content content_;
   bool sealed_;
   const bool library_owned_;
+  bool incomplete_ = false;
 };
 
 }  // namespace parlo::impl

@@ -43,6 +43,14 @@ parlo::bus* make_messaging_bus(const Record& library, const char* name) {
   return created;
 }
 
+// The length of `text`, or `limit` + 1 when it is longer: a hostile string
+// is read no further than that.
+std::size_t bounded_length(const char* text, std::size_t limit) {
+  const char* end = text;
+  while (end != text + limit + 1 && *end != '\0') ++end;
+  return static_cast<std::size_t>(end - text);
+}
+
 listener_list difference(const listener_list& a, const listener_list& b) {
   listener_list out;
   std::set_difference(a.begin(), a.end(), b.begin(), b.end(), std::back_inserter(out));
@@ -56,12 +64,16 @@ bus::bus(const char* name)
       messaging_bus_(make_messaging_bus(*library_, name),
                      messaging_bus_deleter{library_->destroy_bus}),
       pid_(::GetCurrentProcessId()),
-      observer_list_(&observer_list()) {}
+      observer_list_(&observer_list()),
+      publisher_([this] { return send_table(); }) {}
 
 bus::~bus() {
-  // The notifier stops first: the notification in progress may call back
-  // into this bus (an observer may register a listener), so it finishes
-  // while everything is in place; the queued ones are dropped.
+  // The publisher stops first: it takes the changes under the mutex and
+  // posts on the service channel.
+  publisher_.stop();
+  // Then the notifier: the notification in progress may call back into this
+  // bus (an observer may register a listener), so it finishes while
+  // everything is in place; the queued ones are dropped.
   notifier_.stop();
   // Then the service channel: until its subscription is released a delivery
   // thread may still hand a message to this bus, which would use the table.
@@ -99,12 +111,59 @@ std::uint32_t bus::register_listener(const char* channel, const char* id) try {
     logger_stream(level_error, L"bus::register_listener") << L"id is nullptr";
     return ERROR_INVALID_PARAMETER;
   }
-  std::lock_guard<srw_mutex> lock(mutex_);
-  listener item{channel, id};
-  insert_sorted(listeners_[pid_], item);
-  post_new_listener(notifier_, observer_list_, pid_, item);
-  publish_locked();
-  return 0;
+  const std::size_t channel_size = bounded_length(channel, ibus_max_listener_name);
+  const std::size_t id_size = bounded_length(id, ibus_max_listener_name);
+  if (channel_size > ibus_max_listener_name || id_size > ibus_max_listener_name) {
+    logger_stream(level_error, L"bus::register_listener")
+        << (channel_size > ibus_max_listener_name ? L"channel" : L"id") << L" longer than "
+        << ibus_max_listener_name << L" bytes";
+    return ERROR_INVALID_PARAMETER;
+  }
+  const std::uint64_t adds = comm::listener_encoded_bound(channel_size, id_size);
+  std::uint64_t table_bytes = 0;
+  std::size_t table_count = 0;
+  {
+    std::unique_lock<srw_mutex> lock(mutex_);
+    table_bytes = own_bytes_;
+    table_count = own_count_;
+    if (table_bytes + adds <= comm::max_listeners_message_size &&
+        table_count < comm::max_listeners_per_process) {
+      // Everything that may run out of memory comes before the first
+      // change: the table, its notification and the publisher's list of
+      // changes must not disagree.
+      own_change change{/* added */ true,
+                        listener{std::string(channel, channel_size), std::string(id, id_size)}};
+      reserve_change_locked();
+      const auto entry = own_.try_emplace(change.item, 0).first;
+      try {
+        post_new_listener(notifier_, observer_list_, pid_, change.item);
+      } catch (...) {
+        if (entry->second == 0) own_.erase(entry);
+        throw;
+      }
+      ++entry->second;
+      ++own_count_;
+      own_bytes_ += adds;
+      log_change_locked(std::move(change));
+      lock.unlock();
+      // Marked once the lock is free, so that the publisher does not wake
+      // only to wait for it. A publication that took the change already
+      // is followed by one more, with the same table.
+      publisher_.mark_changed();
+      return 0;
+    }
+  }
+  // Accepted, it could never be published, or its peers would refuse the
+  // table: every later change of this process's table would be lost on them.
+  logger_stream line(level_error, L"bus::register_listener");
+  if (table_count >= comm::max_listeners_per_process) {
+    line << L"listener refused: this process has " << table_count
+         << L" listeners, the most its peers take from one process";
+  } else {
+    line << L"listener refused: the table would take more than " << comm::max_listeners_message_size
+         << L" bytes in one message (" << table_bytes << L" now, " << adds << L" more)";
+  }
+  return ERROR_INVALID_PARAMETER;
 } catch (...) {
   logging::log_current_exception(L"bus::register_listener");
   return ERROR_OUTOFMEMORY;
@@ -120,19 +179,38 @@ std::uint32_t bus::unregister_listener(const char* channel, const char* id) try 
     logger_stream(level_error, L"bus::unregister_listener") << L"listener_id is nullptr";
     return ERROR_INVALID_PARAMETER;
   }
-  std::lock_guard<srw_mutex> lock(mutex_);
-  auto own = listeners_.find(pid_);
-  if (own == listeners_.end()) return 0;
-  const listener item{channel, id};
-  auto found = std::find(own->second.begin(), own->second.end(), item);
-  if (found == own->second.end()) return 0;
-  own->second.erase(found);
-  post_listener_removed(notifier_, observer_list_, pid_, item);
-  publish_locked();
+  own_change change{/* added */ false, listener{channel, id}};
+  std::unique_lock<srw_mutex> lock(mutex_);
+  auto found = own_.find(change.item);
+  if (found == own_.end()) return 0;
+  // As in register_listener: what may throw comes before the first change.
+  reserve_change_locked();
+  post_listener_removed(notifier_, observer_list_, pid_, change.item);
+  own_bytes_ -= comm::listener_encoded_bound(change.item.channel.size(), change.item.id.size());
+  --own_count_;
+  if (--found->second == 0) own_.erase(found);
+  log_change_locked(std::move(change));
+  lock.unlock();
+  publisher_.mark_changed();
   return 0;
 } catch (...) {
   logging::log_current_exception(L"bus::unregister_listener");
   return ERROR_OUTOFMEMORY;
+}
+
+void bus::reserve_change_locked() {
+  if (own_changes_.size() < own_changes_.capacity()) return;
+  own_changes_.reserve(std::max<std::size_t>(64, 2 * own_changes_.capacity()));
+}
+
+void bus::log_change_locked(own_change change) noexcept {
+  if (!keeps_changes_) return;
+  if (!own_changes_.empty() && own_changes_.back().added != change.added &&
+      own_changes_.back().item == change.item) {
+    own_changes_.pop_back();
+    return;
+  }
+  own_changes_.push_back(std::move(change));  // room reserved: nothing is allocated
 }
 
 bool bus::is_registered_listener(const char* channel, const char* id) try {
@@ -146,6 +224,7 @@ bool bus::is_registered_listener(const char* channel, const char* id) try {
   }
   const listener item{channel, id};
   std::lock_guard<srw_mutex> lock(mutex_);
+  if (own_.count(item) != 0) return true;
   for (const auto& [pid, list] : listeners_) {
     if (std::find(list.begin(), list.end(), item) != list.end()) return true;
   }
@@ -155,18 +234,41 @@ bool bus::is_registered_listener(const char* channel, const char* id) try {
   return false;
 }
 
-// Publishes this process's list; the caller holds `mutex_`, which keeps the
-// list still while it is encoded, so no copy of it is needed.
-std::uint32_t bus::publish_locked() {
-  if (!service_channel_) return 0;
-  static const listener_list none;
-  auto own = listeners_.find(pid_);
-  return service_channel_->publish_listeners(pid_, own != listeners_.end() ? own->second : none);
+publisher::outcome bus::send_table() {
+  // Only the hand-over of the changes runs under the lock: the host's calls
+  // never wait for an encoding.
+  taken_changes_.clear();
+  {
+    std::lock_guard<srw_mutex> lock(mutex_);
+    taken_changes_.swap(own_changes_);
+  }
+  for (std::size_t i = 0; i < taken_changes_.size(); ++i) {
+    own_change& change = taken_changes_[i];
+    if (!change.added) {
+      const auto found = published_.find(change.item);
+      if (found != published_.end()) published_.erase(found);
+      continue;
+    }
+    try {
+      published_.insert(std::move(change.item));
+    } catch (...) {
+      // Out of memory: the changes not applied go back in front of the
+      // newer ones, and the publisher tries again later.
+      std::lock_guard<srw_mutex> lock(mutex_);
+      own_changes_.insert(own_changes_.begin(), std::make_move_iterator(taken_changes_.begin() + i),
+                          std::make_move_iterator(taken_changes_.end()));
+      throw;
+    }
+  }
+  const comm::listeners_encoder::bytes encoded = encoder_.encode(pid_, published_);
+  return publisher::outcome{service_channel_->publish_listeners(encoded.data, encoded.size), encoded.size};
 }
 
+// Marks the table changed rather than encoding at once: however often peers
+// ask, the publisher sends at its own pace.
 std::uint32_t bus::on_listeners_requested() {
-  std::lock_guard<srw_mutex> lock(mutex_);
-  return publish_locked();
+  publisher_.mark_changed();
+  return 0;
 }
 
 void bus::on_remote_listeners(const std::uint32_t& pid, listener_list received, std::uint32_t origin) {
@@ -244,9 +346,9 @@ void bus::on_connect(std::uint32_t pid) {
         departed_order_.erase(std::find(departed_order_.begin(), departed_order_.end(), pid));
       }
     }
-    if (!service_channel_) return;
-    publish_locked();
   }
+  if (!service_channel_) return;
+  publisher_.mark_changed();
   // Asked once the process counts as connected, so its answer is taken.
   service_channel_->request_remote_listeners();
 }
@@ -263,7 +365,23 @@ void bus::on_remote_error(const char*, std::uint32_t, std::uint32_t) {}
 
 void bus::subscribe() {
   service_channel_ = comm::make_service_channel(this);
-  if (service_channel_) service_channel_->subscribe(this);
+  if (!service_channel_) {
+    stop_keeping_changes();
+    return;
+  }
+  service_channel_->subscribe(this);
+  // From here the publisher's thread reads `service_channel_`.
+  publisher_.enable();
 }
 
-void bus::unsubscribe() { service_channel_.reset(); }
+void bus::unsubscribe() {
+  publisher_.stop();
+  stop_keeping_changes();
+  service_channel_.reset();
+}
+
+void bus::stop_keeping_changes() {
+  std::lock_guard<srw_mutex> lock(mutex_);
+  keeps_changes_ = false;
+  own_changes_.clear();
+}

@@ -5,19 +5,25 @@
 
 #include <windows.h>
 
+#include <algorithm>
+#include <chrono>
+#include <cstdio>
 #include <memory>
 #include <mutex>
+#include <string>
 #include <vector>
 
 #include "bus/bus.h"
 #include "bus/comm/listeners_codec.h"
 #include "bus/parlo/parlo.h"
+#include "platform/handles.h"
 #include "support/bus_observer.h"
 #include "support/log_capture.h"
 
 using test_support::added;
 using test_support::removed;
 using notifications = std::vector<test_support::notification>;
+using namespace std::chrono_literals;
 
 constexpr std::uint32_t other_pid = 4242;
 const std::uint32_t own = ::GetCurrentProcessId();
@@ -57,23 +63,39 @@ class bus_test : public ::testing::Test {
   }
   void publish_as(std::uint32_t pid, const listener_list& listeners) { publish_on(messaging, pid, listeners); }
 
-  // Waits until every message posted so far was delivered and every
-  // notification posted so far ran, and gives what was notified since the
-  // last settle (what was published is left in `published`). A sentinel
-  // listener goes through the same queues last and is cut off.
+  // Waits until every message posted so far was delivered, this process's
+  // table was published and every notification posted so far ran, and gives
+  // what was notified since the last settle (what was published is left in
+  // `published`). A sentinel listener goes through the same queues last and
+  // is cut off, with what it made the bus publish.
   notifications settle() {
-    EXPECT_EQ(0u, messaging->flush(5000));
+    EXPECT_EQ(0u, messaging->flush(20000));  // a request received marks the table changed
+    EXPECT_TRUE(b.wait_published(20s)) << "the publisher still had a change after 20 s";
+    EXPECT_EQ(0u, messaging->flush(20000));  // and its publication reached the spy
+    {
+      std::lock_guard<std::mutex> lock(mutex);
+      published = std::move(pubs);
+      pubs.clear();
+    }
     b.register_listener("~sentinel", "~");
     b.unregister_listener("~sentinel", "~");
     EXPECT_TRUE(test_support::wait_until(
         [&] { return observer.seen().size() > 0 && observer.seen().back() == removed(own, "~sentinel", "~"); }));
-    EXPECT_EQ(0u, messaging->flush(5000));
+    EXPECT_TRUE(b.wait_published(20s));
+    EXPECT_EQ(0u, messaging->flush(20000));
     std::lock_guard<std::mutex> lock(mutex);
-    published.assign(pubs.begin(), pubs.end() - 2);
     pubs.clear();
     notifications notes;
     for (auto& n : observer.take()) if (n.channel != "~sentinel") notes.push_back(std::move(n));
     return notes;
+  }
+  // The tables this process published before the last settle.
+  std::vector<listener_list> own_tables() const {
+    std::vector<listener_list> tables;
+    for (const auto& [pid, listeners] : published) {
+      if (pid == own) tables.push_back(listeners);
+    }
+    return tables;
   }
 
   // The bus goes first, and with its messaging bus the spy's subscription.
@@ -85,7 +107,10 @@ class bus_test : public ::testing::Test {
   parlo::subscription* spy = nullptr;
 };
 
-TEST_F(bus_test, duplicates_are_kept_and_removed_one_at_a_time_each_change_published_whole) {
+// Changes that come while a publication is recent fold into the next one:
+// the peers see some of the whole tables the process went through, in order,
+// and always the last one.
+TEST_F(bus_test, duplicates_are_kept_and_removed_one_at_a_time_and_the_last_table_is_published) {
   EXPECT_EQ(0u, b.register_listener("a", "x"));
   EXPECT_EQ(0u, b.register_listener("a", "x"));
   EXPECT_EQ(0u, b.unregister_listener("a", "x"));
@@ -96,9 +121,108 @@ TEST_F(bus_test, duplicates_are_kept_and_removed_one_at_a_time_each_change_publi
   EXPECT_EQ(0u, b.unregister_listener("never", "registered"));  // nothing found: nothing told
   EXPECT_EQ((notifications{added(own, "a", "x"), added(own, "a", "x"), removed(own, "a", "x"), removed(own, "a", "x")}),
             settle());
-  std::vector<listener_list> tables;
-  for (const auto& [pid, listeners] : published) tables.push_back(pid == own ? listeners : listener_list{{"?", "?"}});
-  EXPECT_EQ((std::vector<listener_list>{{{"a", "x"}}, {{"a", "x"}, {"a", "x"}}, {{"a", "x"}}, {}}), tables);
+  const std::vector<listener_list> states = {{}, {{"a", "x"}}, {{"a", "x"}, {"a", "x"}}, {{"a", "x"}}, {}};
+  const std::vector<listener_list> tables = own_tables();
+  ASSERT_FALSE(tables.empty());
+  std::size_t at = 0;
+  for (const listener_list& table : tables) {
+    while (at < states.size() && states[at] != table) ++at;
+    EXPECT_LT(at, states.size()) << "a table the process never had, or one out of order";
+  }
+  EXPECT_EQ(listener_list{}, tables.back());
+  EXPECT_EQ(tables.size(), published.size()) << "no request was posted";
+}
+
+// A peer that asks again and again is answered at the publisher's pace, not
+// once per request: a table of 10,000 listeners (520 KB) asked for every
+// millisecond for half a second goes out a handful of times.
+TEST_F(bus_test, requests_are_answered_at_the_publishers_pace) {
+  for (int i = 0; i < 10000; ++i) b.register_listener("asked", std::to_string(100000 + i).c_str());
+  settle();
+  const auto start = std::chrono::steady_clock::now();
+  int requests = 0;
+  for (; std::chrono::steady_clock::now() - start < 500ms; ++requests) {
+    post(messaging, 1, nullptr, 0, /* with_blob */ false);
+    ::Sleep(1);
+  }
+  settle();
+  const std::vector<listener_list> tables = own_tables();
+  ASSERT_FALSE(tables.empty()) << "requests were not answered";
+  EXPECT_LE(tables.size(), 20u) << requests << " requests";
+  EXPECT_EQ(10000u, tables.back().size());
+}
+
+// A post the messaging library refuses (its queue is full) is not lost: the
+// publication is logged and goes again, with the newest table.
+TEST_F(bus_test, a_refused_publication_is_logged_and_the_newest_table_goes_again) {
+  ASSERT_EQ(0u, messaging->create_channel("block"));
+  parlo::channel* block = messaging->get_channel("block");
+  winapi::unique_handle release(::CreateEventW(nullptr, /* manual_reset */ TRUE, FALSE, nullptr));
+  // Holds the delivery thread, so that posts pile up in the queue.
+  ASSERT_EQ(0u, block->create_subscription()->listen(
+                    [](parlo::message*, void* event) { ::WaitForSingleObject(static_cast<HANDLE>(event), 30000); },
+                    release.get(), 0));
+  std::uint32_t posted = 0;
+  for (int i = 0; i <= static_cast<int>(parlo::max_queued_messages) + 1 && posted == 0; ++i) {
+    parlo::message* message = messaging->create_message(0);
+    posted = block->post(message);
+    message->release();
+  }
+  ASSERT_EQ(parlo::error_not_enough_quota, posted) << "the delivery queue never filled";
+  b.register_listener("q", "1");
+  EXPECT_TRUE(test_support::wait_for_line(L"publisher::run", L"publication failed err=1816; the table goes again in"))
+      << test_support::dump_log();
+  // Nothing changes any more: only the retry can bring the table out.
+  ::SetEvent(release.get());
+  settle();
+  const std::vector<listener_list> tables = own_tables();
+  ASSERT_FALSE(tables.empty()) << "the refused publication was never made again";
+  EXPECT_EQ((listener_list{{"q", "1"}}), tables.back());
+}
+
+// A name over the documented limit, or a listener that would make the table
+// larger than one message carries, is refused with 87 and a line, never
+// accepted and then lost; a table up to the limit is published whole.
+TEST_F(bus_test, names_and_tables_too_large_for_one_message_are_refused_with_87) {
+  const std::string huge(16u << 20, 'h'), over(ibus_max_listener_name + 1, 'o');
+  const struct {
+    std::string channel, id;
+    const wchar_t* line;
+  } refused[] = {
+      {"c", huge, L"id longer than 65536 bytes"},
+      {"c", over, L"id longer than 65536 bytes"},
+      {over, "i", L"channel longer than 65536 bytes"},
+  };
+  for (const auto& r : refused) {
+    test_support::clear_log();
+    EXPECT_EQ(87u, b.register_listener(r.channel.c_str(), r.id.c_str())) << r.id.size();
+    EXPECT_TRUE(test_support::has_line(L"bus::register_listener", r.line)) << test_support::dump_log();
+    EXPECT_FALSE(b.is_registered_listener(r.channel.c_str(), r.id.c_str()));
+  }
+  // No more listeners than a peer takes from one process: it would refuse
+  // the whole table.
+  for (std::size_t i = 0; i < comm::max_listeners_per_process; ++i) {
+    ASSERT_EQ(0u, b.register_listener("n", std::to_string(i).c_str())) << i;
+  }
+  EXPECT_EQ(87u, b.register_listener("n", "one more"));
+  EXPECT_TRUE(test_support::has_line(L"bus::register_listener", L"listener refused: this process has 16384 listeners"));
+  for (std::size_t i = 0; i < comm::max_listeners_per_process; ++i) b.unregister_listener("n", std::to_string(i).c_str());
+  // The longest ids the bus takes, until the table is full.
+  std::string id(ibus_max_listener_name, 'i');
+  std::size_t accepted = 0;
+  for (; accepted < 300; ++accepted) {
+    id.replace(0, 3, std::to_string(100 + accepted));
+    if (b.register_listener("c", id.c_str()) != 0) break;
+  }
+  EXPECT_TRUE(test_support::has_line(L"bus::register_listener",
+                                     L"listener refused: the table would take more than 16777186 bytes in one message"));
+  EXPECT_GT(accepted, 250u);
+  EXPECT_EQ(0u, b.register_listener("small", "1")) << "a listener that fits is still taken";
+  settle();
+  const std::vector<listener_list> tables = own_tables();
+  ASSERT_FALSE(tables.empty());
+  EXPECT_EQ(accepted + 1, tables.back().size()) << "the full table was not published whole";
+  EXPECT_FALSE(test_support::has_line(L"comm::service_channel::publish_listeners", L"")) << test_support::dump_log();
 }
 
 // Additions before removals; an empty list empties the process's entry; a
@@ -147,13 +271,17 @@ TEST_F(bus_test, malformed_listeners_messages_are_dropped_with_the_exact_lines) 
 TEST_F(bus_test, connect_publishes_and_asks_and_the_last_disconnect_drops_the_process_for_good) {
   b.register_listener("own", "1");
   settle();
-  // Each connect publishes, then asks (no pid): the bus answers itself too.
+  // Each connect asks once (no pid) and publishes the table; the bus answers
+  // its own request too, folded into that publication or after it.
   for (const bool local : {true, false}) {
     local ? b.on_local_connect("\\pipe", other_pid) : b.on_remote_connect("\\other", other_pid);
     settle();
     std::vector<std::uint32_t> pids;
     for (const auto& p : published) pids.push_back(p.first);
-    EXPECT_EQ((std::vector<std::uint32_t>{own, 0, own}), pids);
+    EXPECT_EQ(1, std::count(pids.begin(), pids.end(), 0u)) << "one request";
+    const std::vector<listener_list> tables = own_tables();
+    ASSERT_TRUE(!tables.empty() && tables.size() <= 2) << tables.size();
+    EXPECT_EQ((listener_list{{"own", "1"}}), tables.back());
   }
 
   publish_as(other_pid, {{"c", "3"}, {"a", "1"}, {"b", "2"}});

@@ -86,4 +86,32 @@ TEST_F(e2e_test, processes_exchange_tables_and_rejoin_a_restarted_server) {
   EXPECT_TRUE(server->wait_for(plus(own(), "c1")));
 }
 
+// A listener too large for any message is refused with 87 and a line,
+// instead of being taken and making every later publication unreadable: the
+// process's later listeners still reach its peer, and the peer never sees a
+// publication without its table.
+TEST_F(e2e_test, an_oversized_listener_is_refused_and_later_ones_still_reach_the_peer) {
+  const std::string pipe = "\\\\.\\pipe\\vorbel_e2e_oversize";
+  this_process us({{pipe, 0}}, {}, "before");
+  ASSERT_TRUE(us.up()) << dump_log();
+  write_file("oversize_peer.log", "");  // the logging library appends
+  auto peer = start_host("host_a", "oversize_peer", host_config({pipe}));
+  ASSERT_TRUE(peer->ready()) << peer->output();
+  ASSERT_TRUE(peer->wait_for(plus(own(), "before"), 20s)) << peer->output();
+  const std::string huge(16u << 20, 'h');
+  EXPECT_EQ(87u, us.bus().register_listener("alerts", huge.c_str()));
+  EXPECT_TRUE(has_line(L"bus::register_listener", L"id longer than 65536 bytes")) << dump_log();
+  EXPECT_EQ(0u, us.bus().register_listener("alerts", "after"));
+  EXPECT_TRUE(peer->wait_for(plus(own(), "after"), 20s)) << peer->output();
+  // A table as large as the bus takes still reaches the peer whole, with
+  // what the pipe adds to it on the way.
+  std::string id(ibus_max_listener_name, 'i');
+  for (int i = 100; i < 400 && us.bus().register_listener("big", id.replace(0, 3, std::to_string(i)).c_str()) == 0;) ++i;
+  EXPECT_TRUE(has_line(L"bus::register_listener", L"listener refused: the table would take more than")) << dump_log();
+  EXPECT_EQ(0u, us.bus().register_listener("alerts", "last"));
+  EXPECT_TRUE(peer->wait_for(plus(own(), "last"), 30s)) << "the full table did not reach the peer";
+  EXPECT_EQ(std::string::npos, read_file("oversize_peer.log").find("params blob")) << "the peer got an empty publication";
+  EXPECT_FALSE(has_line(L"comm::service_channel::publish_listeners", L"")) << dump_log();
+}
+
 }  // namespace

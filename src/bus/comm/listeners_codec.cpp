@@ -2,7 +2,7 @@
 
 #include <algorithm>
 
-#include "listeners_message_generated.h"
+#include "bus/comm/listeners_build.h"
 
 namespace comm {
 namespace {
@@ -15,29 +15,8 @@ std::string copy_to_first_zero(const flatbuffers::String* text) {
 }  // namespace
 
 std::vector<std::uint8_t> encode_listeners(std::uint32_t pid, const listener_list& listeners) {
-  // At least 1 KB, and room for the whole message up front: a builder that
-  // regrows copies everything built so far each time, which made large
-  // tables cost several times their size.
-  std::size_t expected = 64;
-  for (const listener& item : listeners) expected += item.channel.size() + item.id.size() + 48;
-  flatbuffers::FlatBufferBuilder builder(std::max<std::size_t>(1024, expected));
-  std::vector<flatbuffers::Offset<wire::listener>> tables;
-  tables.reserve(listeners.size());
-  for (const listener& item : listeners) {
-    // The id string is made first and the id field added first: peers may
-    // compare buffers byte for byte.
-    const auto id = builder.CreateString(item.id);
-    const auto channel = builder.CreateString(item.channel);
-    wire::listenerBuilder table(builder);
-    table.add_id(id);
-    table.add_channel(channel);
-    tables.push_back(table.Finish());
-  }
-  const auto vector = builder.CreateVector(tables);
-  wire::listeners_messageBuilder root(builder);
-  root.add_listeners(vector);
-  root.add_pid(pid);  // a pid of 0 is the default and is left out
-  builder.Finish(root.Finish());
+  flatbuffers::FlatBufferBuilder builder(build::expected_size(listeners));
+  build::build_listeners(builder, pid, listeners);
   return std::vector<std::uint8_t>(builder.GetBufferPointer(),
                                    builder.GetBufferPointer() + builder.GetSize());
 }

@@ -16,7 +16,7 @@ using logging::level_error;
 using logging::level_info;
 using logging::logger_stream;
 
-constexpr const char* params_blob = "params";
+constexpr const char* params_blob = listeners_blob_name;
 
 // The process a message came from, when the IPC library delivered it from a
 // pipe: 0 for a message posted in this process (or by a library that cannot
@@ -153,20 +153,23 @@ std::uint32_t service_channel::request_remote_listeners() {
   return posted;
 }
 
-std::uint32_t service_channel::publish_listeners(std::uint32_t pid, const listener_list& listeners) {
-  parlo::message* message = new_message(L"comm::service_channel::publish_listeners",
-                                         service_channel_messages_id::listeners);
+std::uint32_t service_channel::publish_listeners(const std::uint8_t* bytes, std::size_t size) {
+  const wchar_t* const function = L"comm::service_channel::publish_listeners";
+  parlo::message* message = new_message(function, service_channel_messages_id::listeners);
   if (message == nullptr) return ERROR_OUTOFMEMORY;
-  {
-    const std::vector<std::uint8_t> bytes = encode_listeners(pid, listeners);
-    message->set_blob(params_blob, bytes.data(), bytes.size());
+  // A message without its blob would reach the peers as an empty
+  // publication they cannot read: it is not posted at all.
+  const std::uint32_t set = message->set_blob(params_blob, bytes, size);
+  if (set != 0) {
+    message->release();
+    logger_stream(level_error, function) << L"set_blob listeners message size=" << size << L" err=" << set;
+    return set;
   }
   message->seal();
   const std::uint32_t posted = channel_->post(message);
   message->release();
   if (posted != 0) {
-    logger_stream(level_error, L"comm::service_channel::publish_listeners")
-        << L"post listeners message err=" << posted;
+    logger_stream(level_error, function) << L"post listeners message err=" << posted;
   }
   return posted;
 }

@@ -9,33 +9,35 @@
 // registry's mutex, through the gateway.
 #pragma once
 
+#include <cstddef>
 #include <cstdint>
 #include <memory>
 #include <set>
 #include <string>
 
 #include "bus/listener.h"
+#include "bus/parlo/parlo.h"
+#include "gateway/parlo_ipc/parlo_ipc.h"
 
 struct ibus;
-
-namespace parlo {
-class channel;
-class message;
-class subscription;
-}  // namespace parlo
-
-namespace parlo::ipc {
-class gateway;
-}
 
 namespace comm {
 
 constexpr const char* service_channel_name = "vorbel_service";
+// The blob of a listeners message, and the largest message it can hold: the
+// messaging library carries at most parlo::max_message_size bytes of blobs
+// in one message, their names included, and the receiving IPC library adds
+// the origin blob (4 bytes under its name) to every message from a pipe.
+constexpr const char* listeners_blob_name = "params";
+constexpr std::uint64_t max_listeners_message_size =
+    parlo::max_message_size - std::char_traits<char>::length(listeners_blob_name) -
+    (std::char_traits<char>::length(parlo::ipc::origin_pid_blob) + 4);
 
 // Most listeners taken from one process: a larger list is refused with a
 // line (the connection stays, and the process's earlier list with it), so
 // that a peer cannot make this process hold more than this many of its
-// listeners. At a few hundred bytes per listener, a few MiB per peer.
+// listeners. At a few hundred bytes per listener, a few MiB per peer. A bus
+// registers no more than this itself: its peers would refuse its table.
 constexpr std::size_t max_listeners_per_process = 16384;
 
 enum class service_channel_messages_id : std::uint32_t {
@@ -73,9 +75,10 @@ class service_channel {
   std::uint32_t export_channel(parlo::ipc::gateway* ipc, const char* pipe);
   std::uint32_t import_channel(parlo::ipc::gateway* ipc, const char* bus_name, const char* pipe);
 
-  // Posts this process's listeners. Called under the bus's mutex: it must not
-  // call back into the bus.
-  std::uint32_t publish_listeners(std::uint32_t pid, const listener_list& listeners);
+  // Posts an encoded listeners message (listeners_codec.h) as message id 2.
+  // 0, or the messaging library's refusal of the blob or of the post,
+  // logged; nothing is posted without its blob.
+  std::uint32_t publish_listeners(const std::uint8_t* bytes, std::size_t size);
   // Asks every process on the channel to publish its listeners.
   std::uint32_t request_remote_listeners();
 

@@ -40,7 +40,8 @@ inline constexpr std::uint32_t success = 0;
 inline constexpr std::uint32_t error_access_denied = 5;
 // The library could not allocate what the call needs.
 inline constexpr std::uint32_t error_not_enough_memory = 8;
-// Bytes that do not decode as a message (parlo_ext.h).
+// Bytes that do not decode as a message (parlo_ext.h); a message one of
+// whose set_blob calls was refused (post: it is not what its caller built).
 inline constexpr std::uint32_t error_invalid_data = 13;
 // A reserved slot.
 inline constexpr std::uint32_t error_not_implemented = 120;
@@ -124,7 +125,8 @@ class message {
   // that name. `data` may be null only with size 0. 0, or
   // error_invalid_parameter (null name or data, bad name length, too many
   // fields, message over max_message_size), error_access_denied (sealed),
-  // error_not_enough_memory.
+  // error_not_enough_memory. After a refusal (other than on a sealed
+  // message) post refuses the message until clear().
   virtual std::uint32_t set_blob(const char* name, const void* data, std::uint64_t size) = 0;
   // 16-18
   virtual std::uint32_t reserved_16() = 0;
@@ -174,8 +176,10 @@ class channel {
   // listens on this channel (and for the IPC library's taps, parlo_ext.h),
   // and returns. The message stays the caller's, unchanged; it may be
   // changed or released at once. 0, or error_invalid_parameter (null, or not
-  // a live message of this library), error_not_enough_quota (queue full),
-  // error_invalid_state (bus being destroyed), error_not_enough_memory.
+  // a live message of this library), error_invalid_data (a set_blob on the
+  // message was refused: nothing is delivered rather than a message without
+  // that blob), error_not_enough_quota (queue full), error_invalid_state
+  // (bus being destroyed), error_not_enough_memory.
   virtual std::uint32_t post(message* message) = 0;
   // 2: the bus the channel belongs to.
   virtual bus* get_bus() = 0;

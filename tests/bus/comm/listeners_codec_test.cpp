@@ -79,3 +79,45 @@ TEST(listeners_codec, entries_sharing_one_string_are_refused) {
   EXPECT_TRUE(out.empty());
 }
 
+
+// What a sender counts instead of encoding: never less than the message, so
+// a table it accepts always fits; and not much more, so it refuses little
+// that would have fitted. Every string length modulo 4 is covered, empty
+// strings and long ones included; the reusable encoder gives the same bytes.
+TEST(listeners_codec, the_size_bound_holds_for_every_string_length) {
+  comm::listeners_encoder encoder;
+  for (std::size_t count : {0, 1, 2, 7, 100}) {
+    for (std::size_t length = 0; length < 12; ++length) {
+      listener_set table;
+      std::uint64_t bound = comm::listeners_fixed_bound;
+      for (std::size_t i = 0; i < count; ++i) {
+        listener item{std::string((length + i) % 9, 'c'), std::string(length * (i % 3) + i % 5, 'i') + std::to_string(i)};
+        bound += comm::listener_encoded_bound(item.channel.size(), item.id.size());
+        table.insert(std::move(item));
+      }
+      const auto bytes = comm::encode_listeners(0xFFFFFFFF, listener_list(table.begin(), table.end()));
+      EXPECT_LE(bytes.size(), bound) << count << " listeners, length " << length;
+      EXPECT_LE(bound - bytes.size(), 64 + 8 * count) << count << " listeners, length " << length;
+      const auto reused = encoder.encode(0xFFFFFFFF, table);
+      EXPECT_EQ(bytes, std::vector<std::uint8_t>(reused.data, reused.data + reused.size));
+    }
+  }
+  listener_set big;
+  big.insert({"c", std::string(65536, 'x')});
+  const auto one = encoder.encode(1, big);  // the encoder grows past its first buffer
+  EXPECT_LE(one.size, comm::listeners_fixed_bound + comm::listener_encoded_bound(1, 65536));
+  std::uint32_t pid = 0;
+  listener_list out;
+  EXPECT_TRUE(comm::decode_listeners(one.data, one.size, pid, out) && out.size() == 1 && pid == 1);
+}
+
+// The listener order is std::string's: bytes compared unsigned, the shorter
+// string first on a common prefix, channel before id.
+TEST(listeners_codec, listeners_order_by_unsigned_bytes_channel_first) {
+  const std::pair<listener, listener> ascending[] = {
+      {{"a", "z"}, {"b", "a"}}, {{"a", ""}, {"a", "0"}}, {{"ab", "a"}, {"abc", ""}}, {{"a", "\x7f"}, {"a", "\x80"}},
+      {{"\x01", "x"}, {"\xff", "x"}}, {{"same", "id-1"}, {"same", "id-10"}}};
+  for (const auto& [low, high] : ascending) {
+    EXPECT_TRUE(low < high && !(high < low) && !(low < low)) << low.channel << "/" << low.id;
+  }
+}

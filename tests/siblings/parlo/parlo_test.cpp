@@ -139,6 +139,34 @@ TEST_F(parlo_test, a_posted_message_the_caller_changes_and_releases_is_delivered
   EXPECT_EQ(1u, got.items[1].first);
 }
 
+// A message whose blob was refused is not posted at all: delivered, it would
+// reach its receivers without the blob they read. Its copies neither; a
+// cleared message is whole again.
+TEST_F(parlo_test, a_message_whose_blob_was_refused_is_not_posted) {
+  recorder got;
+  parlo::channel* channel = subscribed("whole", &recorder::on_message, &got);
+  const std::vector<char> big(parlo::max_message_size, 'b');
+  parlo::message* message = bus_->create_message(0);
+  ASSERT_EQ(0u, message->set_blob("small", "s", 1));
+  EXPECT_EQ(parlo::error_invalid_parameter, message->set_blob("big", big.data(), big.size()));
+  EXPECT_EQ(0u, message->set_blob("small", "t", 1)) << "a later blob does not make it whole";
+  parlo::message* copy = message->copy();
+  EXPECT_EQ(parlo::error_invalid_data, channel->post(message));
+  EXPECT_EQ(parlo::error_invalid_data, channel->post(copy));
+  ASSERT_EQ(0u, message->clear());
+  message->set_message_id(7);
+  EXPECT_EQ(0u, channel->post(message));
+  ASSERT_EQ(0u, bus_->flush(wait_ms));
+  ASSERT_EQ(1u, got.items.size());
+  EXPECT_EQ(7u, got.items[0].first);
+  // A refusal on a sealed message leaves it as it was sealed.
+  message->seal();
+  EXPECT_EQ(parlo::error_access_denied, message->set_blob("late", "x", 1));
+  EXPECT_EQ(0u, channel->post(message));
+  EXPECT_EQ(0u, copy->release());
+  EXPECT_EQ(0u, message->release());
+}
+
 TEST_F(parlo_test, null_arguments_are_refused_with_87) {
   EXPECT_EQ(nullptr, create_bus(nullptr));
   destroy_bus(nullptr);
