@@ -48,7 +48,7 @@ struct ibus : ibus_base, qm::iobservable<ibus_observer_base*> {
   // ibus_max_listener_name, or a listener that would make this process's
   // table too large to publish in one message of the messaging library (about
   // 16 MiB: the channel and id of each listener plus 32 bytes) or larger than
-  // its peers take from one process (16,384 listeners); or 14
+  // its peers take from one process (65,536 listeners); or 14
   // (ERROR_OUTOFMEMORY) when memory ran out. Registering the same pair twice
   // keeps two entries. Other processes learn of a registration shortly after
   // it returns (see the architecture notes).

@@ -145,16 +145,16 @@ TEST_F(trust_attack_test, a_flood_under_a_phantom_pid_or_over_the_cap_leaves_not
   // and the heap make what they keep for messages this large. The bytes in
   // use are counted block by block: the resident memory moves by a few MiB
   // from round to round under Wine with the blocks the heap keeps free.
-  round("warm_up", [](DWORD) { return listeners(own(), 100000, "w") + listeners(own(), 16385, "b"); });
+  round("warm_up", [](DWORD) { return listeners(own(), 100000, "w") + listeners(own(), 65537, "b"); });
   clear_log();
   const long long before = heap_bytes_in_use();
   const long long resident_before = private_bytes();
-  round("flood", [&](DWORD self) { return listeners(phantom, 100000, "p") + listeners(self, 16385, "big"); });
+  round("flood", [&](DWORD self) { return listeners(phantom, 100000, "p") + listeners(self, 65537, "big"); });
   EXPECT_EQ(0u, us.observer.current().count(phantom));
   EXPECT_TRUE(has_line(L"comm::service_channel::on_message",
                        L"listeners message of pid=" + std::to_wstring(phantom) + L" refused: it came from pid="))
       << dump_log();
-  EXPECT_TRUE(has_line(L"comm::service_channel::on_message", L" refused: 16385 listeners, more than 16384"))
+  EXPECT_TRUE(has_line(L"comm::service_channel::on_message", L" refused: 65537 listeners, more than 65536"))
       << dump_log();
   // The connection's thread gives its buffers back just after the
   // disconnect that emptied the table.

@@ -36,9 +36,11 @@ constexpr std::uint64_t max_listeners_message_size =
 // Most listeners taken from one process: a larger list is refused with a
 // line (the connection stays, and the process's earlier list with it), so
 // that a peer cannot make this process hold more than this many of its
-// listeners. At a few hundred bytes per listener, a few MiB per peer. A bus
-// registers no more than this itself: its peers would refuse its table.
-constexpr std::size_t max_listeners_per_process = 16384;
+// listeners. At about a hundred bytes per listener held, some 7 MiB per
+// peer at most; well above the tens of thousands a host registers in a
+// burst. A bus registers no more than this itself: its peers would refuse
+// its table.
+constexpr std::size_t max_listeners_per_process = 65536;
 
 enum class service_channel_messages_id : std::uint32_t {
   publish_listeners = 1,  // no content: asks every receiver to publish
